@@ -40,7 +40,11 @@ template <class T>
 LogArg makeLogArg(const T& v) {
     LogArg a;
     using D = std::decay_t<T>;
-    if constexpr (std::is_same_v<D, bool>) {
+    if constexpr (std::is_array_v<std::remove_reference_t<T>>) {  // string literals
+        a.kind = LogArg::Kind::String;
+        a.s = std::string(v);
+        a.p = v;
+    } else if constexpr (std::is_same_v<D, bool>) {
         a.kind = LogArg::Kind::Signed;
         a.i = v ? 1 : 0;
     } else if constexpr (std::is_integral_v<D> && std::is_signed_v<D>) {

@@ -87,8 +87,9 @@ public:
 
     bool operator==(const Value& other) const;
 
+    struct Node;  // opaque
+
 private:
-    struct Node;
     explicit Value(std::shared_ptr<const Node> n) : node_(std::move(n)) {}
     std::shared_ptr<const Node> node_;
 };

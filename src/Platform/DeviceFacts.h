@@ -1,0 +1,31 @@
+// Device and build facts: etc/vesseld/device.plist and etc/os-release of the system
+// root, read once on first use (tests call reloadDeviceFacts after changing them).
+#pragma once
+
+#include <sys/types.h>
+
+#include <map>
+#include <string>
+
+namespace vsl {
+
+struct DeviceFacts {
+    bool internalBuild = false;
+    bool multiUser = false;
+    bool personasSupported = false;
+    bool ephemeralStorage = false;
+    std::map<std::string, bool> featureFlags;
+    uid_t installerUID = 33;
+    uid_t systemContainerUID = 0;
+    std::string buildVersion;  // BUILD_ID of etc/os-release, "" when absent
+
+    bool featureEnabled(const std::string& name) const {
+        auto it = featureFlags.find(name);
+        return it != featureFlags.end() && it->second;
+    }
+};
+
+const DeviceFacts& deviceFacts();
+void reloadDeviceFacts();
+
+}  // namespace vsl
