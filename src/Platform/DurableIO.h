@@ -6,8 +6,10 @@
 // Functions return 0 or an errno value.
 #pragma once
 
+#include <sys/acl.h>
 #include <sys/types.h>
 
+#include <ctime>
 #include <cstddef>
 #include <cstdint>
 #include <string>
@@ -29,5 +31,40 @@ int fsyncParent(const std::string& path);
 int writeFile(const std::string& path, const void* data, size_t length, mode_t mode);
 // Temporary file beside `path`, fsync, rename over `path`, fsync of the directory.
 int writeFileAtomically(const std::string& path, const void* data, size_t length, mode_t mode);
+// mkdtemp: `templ` ends in "XXXXXX" and is filled in on success.
+int makeTemporaryDirectory(std::string* templ);
+
+// Descriptor-relative forms for walks: `path` only names the step in the trace. They
+// never follow a final symbolic link.
+int makeDirectoryAt(int dirfd, const char* name, mode_t mode, const std::string& path);
+int createFileAt(int dirfd, const char* name, mode_t mode, const std::string& path, int* fd);  // O_EXCL
+int makeSymlinkAt(const std::string& target, int dirfd, const char* name, const std::string& path);
+int makeNodeAt(int dirfd, const char* name, mode_t mode, dev_t dev, const std::string& path);
+int removeAt(int dirfd, const char* name, bool directory, const std::string& path);
+// Whole contents of `from` (`length` bytes, -1 if unknown) into the empty file `to`: a
+// clone where the file system can, else an in-kernel copy, else read/write. `*method`
+// is where to start and comes back as what worked, so a tree copy stops retrying
+// what this pair of file systems cannot do.
+enum class CopyMethod { Clone, KernelCopy, ReadWrite };
+int copyFileData(int from, int to, off_t length, const std::string& path, CopyMethod* method = nullptr);
+
+// Attribute changes. `fd` may be an O_PATH descriptor that pinned the item, so a path
+// swapped after the caller's check cannot redirect the write.
+int changeOwner(const std::string& path, uid_t uid, gid_t gid);  // follows a final link
+int changeOwnerOfNode(int fd, const std::string& path, uid_t uid, gid_t gid);
+int changeOwnerAt(int dirfd, const char* name, uid_t uid, gid_t gid, const std::string& path);
+int changeMode(const std::string& path, mode_t mode);
+int changeModeOfNode(int fd, const std::string& path, mode_t mode);  // not for symbolic links
+int setTimesOfNode(int fd, const std::string& path, const struct timespec times[2]);
+int setTimesAt(int dirfd, const char* name, const struct timespec times[2], const std::string& path);
+int setXattr(int fd, const std::string& path, const char* name, const void* value, size_t size);
+int removeXattr(int fd, const std::string& path, const char* name);
+int setACL(int fd, const std::string& path, acl_type_t type, acl_t acl);
+int removeDefaultACL(int fd, const std::string& path);
+// FS_IOC_SETFLAGS: needs an ordinary (not O_PATH) descriptor.
+int setFlags(int fd, const std::string& path, unsigned flags);
+
+// "/proc/self/fd/N": names what `fd` refers to, whatever happened to its path since.
+std::string descriptorPath(int fd);
 
 }  // namespace vsl::durable

@@ -11,6 +11,7 @@
 
 #include <concepts>
 #include <cstdint>
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -185,5 +186,19 @@ private:
     uint64_t id_;
     bool ended_ = false;
 };
+
+// ---- test hook: what the structured log would send, instead of sending it ----
+
+struct OSLogRecord {
+    LogCategory category;
+    OSLogLevel level;
+    std::string message;
+    const char* signpostEvent = nullptr;  // "begin" / "end" for signposts, else null
+    const char* signpostName = nullptr;
+    uint64_t signpostId = 0;
+};
+// While set, every structured-log record goes to the sink only; an empty function
+// restores the journal/stderr destination.
+void setOSLogSink(std::function<void(const OSLogRecord&)> sink);
 
 }  // namespace vsl

@@ -106,17 +106,17 @@ bool Value::isNumber() const {
 }
 
 template <class T>
-static std::optional<T> get(const auto& v) {
+static std::optional<T> valueAs(const auto& v) {
     if (auto p = std::get_if<T>(&v)) return *p;
     return std::nullopt;
 }
 
-std::optional<bool> Value::boolValue() const { return get<bool>(node_->v); }
-std::optional<uint64_t> Value::uint64Value() const { return get<uint64_t>(node_->v); }
-std::optional<int64_t> Value::int64Value() const { return get<int64_t>(node_->v); }
-std::optional<double> Value::doubleValue() const { return get<double>(node_->v); }
-std::optional<Uuid> Value::uuidValue() const { return get<Uuid>(node_->v); }
-std::optional<Date> Value::dateValue() const { return get<Date>(node_->v); }
+std::optional<bool> Value::boolValue() const { return valueAs<bool>(node_->v); }
+std::optional<uint64_t> Value::uint64Value() const { return valueAs<uint64_t>(node_->v); }
+std::optional<int64_t> Value::int64Value() const { return valueAs<int64_t>(node_->v); }
+std::optional<double> Value::doubleValue() const { return valueAs<double>(node_->v); }
+std::optional<Uuid> Value::uuidValue() const { return valueAs<Uuid>(node_->v); }
+std::optional<Date> Value::dateValue() const { return valueAs<Date>(node_->v); }
 const std::string* Value::stringValue() const { return std::get_if<std::string>(&node_->v); }
 const Data* Value::dataValue() const { return std::get_if<Data>(&node_->v); }
 const Array* Value::arrayValue() const { return std::get_if<Array>(&node_->v); }

@@ -58,10 +58,7 @@ public:
             idler->cv.notify_one();
             --uncovered;
         }
-        while (uncovered > 0 && workers_ < eagerWorkers_) {
-            spawnLocked();
-            --uncovered;
-        }
+        while (uncovered > 0 && workers_ < eagerWorkers_ && spawnLocked()) --uncovered;
         if (uncovered > 0) {
             if (!monitorStarted_) {
                 monitorStarted_ = true;
@@ -110,13 +107,15 @@ private:
         return !ready_[0].empty() || !ready_[1].empty() || !ready_[2].empty();
     }
 
-    void spawnLocked() {
+    bool spawnLocked() {
         ++workers_;
         try {
             std::thread([this] { work(); }).detach();
+            return true;
         } catch (const std::system_error& e) {
             --workers_;
             std::fprintf(stderr, "vsl::WorkQueue: cannot start a pool worker: %s\n", e.what());
+            return false;
         }
     }
 
@@ -167,7 +166,7 @@ private:
                 if (!ready.empty()) oldest = std::min(oldest, ready.front().since);
             }
             if (idle_.empty() && Clock::now() - oldest >= kSpawnDelay && workers_ < kMaxWorkers) {
-                ;
+                spawnLocked();
             }
             monitorCv_.wait_for(lock, kSpawnDelay);
         }
@@ -266,6 +265,7 @@ std::shared_ptr<WorkQueue> WorkQueue::concurrent(std::string label, QueuePriorit
 }
 
 const std::shared_ptr<WorkQueue>& WorkQueue::main() {
+    MainLoop::shared();  // exists before anyone may stop it from a signal handler
     static auto* queue = new std::shared_ptr<WorkQueue>(
         std::make_shared<WorkQueue>(Passkey{}, "main", Attributes{}, true));
     return *queue;
@@ -332,7 +332,7 @@ void WorkQueue::drain() {
         Item item = std::move(items_.front());
         items_.pop_front();
         lock.unlock();
-        invoke(item, item.parent);
+        invoke(item.work, item.parent);
         item = {};  // release captures (and the transactions they hold) right after the run
         lock.lock();
     }
@@ -342,11 +342,11 @@ void WorkQueue::drain() {
     issue(tokens);
 }
 
-void WorkQueue::invoke(Item& item, const Frame* parent) {
+void WorkQueue::invoke(const Work& work, const Frame* parent) {
     const Frame frame{this, parent};
     const Frame* saved = currentFrame_;
     currentFrame_ = &frame;
-    runItem(item.work);
+    runItem(work);
     currentFrame_ = saved;
 }
 
@@ -363,8 +363,7 @@ void WorkQueue::sync(const Work& work) {
         if (!mainThread_ && suspendCount_ == 0 && free) {
             ++inlineRunning_;
             lock.unlock();
-            Item item{work, nullptr};
-            invoke(item, currentFrame_);
+            invoke(work, currentFrame_);
             lock.lock();
             --inlineRunning_;
             const unsigned tokens = claimTokensLocked();
@@ -410,7 +409,9 @@ bool WorkQueue::isCurrent() const {
     return false;
 }
 
-std::string WorkQueue::currentLabel() { return currentFrame_ ? currentFrame_->queue->label_ : std::string(); }
+std::string WorkQueue::currentLabel() {
+    return currentFrame_ ? currentFrame_->queue->label_ : std::string();
+}
 
 size_t WorkQueue::poolWorkerCount() { return Pool::shared().workerCount(); }
 

@@ -96,7 +96,7 @@ private:
 
     void push(Item item);
     void drain();
-    void invoke(Item& item, const Frame* parent);
+    void invoke(const Work& work, const Frame* parent);
     unsigned claimTokensLocked();
     void issue(unsigned tokens);
     [[noreturn]] void fail(const char* what) const;
@@ -116,7 +116,7 @@ private:
 // may run it at a time.
 void runMainLoop();
 // Makes runMainLoop() return after the item it is running, or at once if it is called
-// later. Async-signal-safe.
+// later. Async-signal-safe once WorkQueue::main() or runMainLoop() has been called.
 void stopMainLoop();
 
 // Tracks a set of work items: wait for them, or be notified once they have all left.

@@ -3,7 +3,13 @@
 #include <stdexcept>
 
 #include "Daemon/Core/VSLExceptionGuard.h"
+#include <sys/stat.h>
+#include <unistd.h>
+
 #include "Platform/CrashAnnotation.h"
+#include "Platform/DeviceFacts.h"
+#include "Platform/PropertyList.h"
+#include "Platform/SystemRoot.h"
 #include "Platform/Log.h"
 #include "Support/TempRoot.h"
 
@@ -73,11 +79,25 @@ TEST(ExceptionGuard, ReportTextShape) {
 
 TEST(ExceptionGuardDeathTest, InternalBuildAbortsWithReportInAnnotation) {
     GTEST_FLAG_SET(death_test_style, "threadsafe");
-    test::TempRoot root;
-    root.writeDeviceFacts(dict({{"InternalBuild", Value::boolean(true)}}));
-    std::string annotation = root.at("crash-annotation.txt");
+    // The child re-runs this body: every path here must come out the same in both.
+    std::string root = ::testing::TempDir() + "vessel-internal-root";
+    std::string annotation = ::testing::TempDir() + "vessel-crash-annotation.txt";
+    ::unlink(annotation.c_str());
+    auto setUpRoot = [&] {
+        test::removeTree(root);
+        ::mkdir(root.c_str(), 0755);
+        ::mkdir((root + "/etc").c_str(), 0755);
+        ::mkdir((root + "/etc/vesseld").c_str(), 0755);
+        auto bytes = encodeBinaryPropertyList(dict({{"InternalBuild", Value::boolean(true)}}), nullptr);
+        FILE* f = fopen((root + "/etc/vesseld/device.plist").c_str(), "w");
+        fwrite(bytes->data(), 1, bytes->size(), f);
+        fclose(f);
+        setSystemRoot(root);
+        reloadDeviceFacts();
+    };
     EXPECT_DEATH(
         {
+            setUpRoot();
             setCrashAnnotationFile(annotation);
             VSLErrorRef error;
             VSL_GUARD_EXCEPTIONS(&error, [] () -> bool { throw std::out_of_range("index 9"); });
@@ -85,4 +105,6 @@ TEST(ExceptionGuardDeathTest, InternalBuildAbortsWithReportInAnnotation) {
         "INTERNAL ERROR: Uncaught Exception \\*\\*\nException: .*std::out_of_range: index 9\nStack:");
     std::string text = test::readFile(annotation);
     EXPECT_EQ(0u, text.find("** INTERNAL ERROR: Uncaught Exception **\nException: ")) << text;
+    test::removeTree(root);
+    ::unlink(annotation.c_str());
 }

@@ -4,6 +4,7 @@
 #include <gtest/gtest.h>
 
 #include <memory>
+#include <thread>
 
 using namespace std::chrono_literals;
 using vsl::openTransactionCount;

@@ -222,7 +222,8 @@ TEST(WorkQueueDeathTest, MisuseAbortsNamingTheQueue) {
             a->sync([&] { b->sync([&] { a->sync([] {}); }); });
         },
         "test.cycle.a.*deadlock");
-    EXPECT_DEATH(WorkQueue::serial("test.over.resume")->resume(), "test.over.resume.*not suspended");
+    EXPECT_DEATH(WorkQueue::serial("test.over.resume")->resume(),
+                 "test.over.resume.*not suspended");
     EXPECT_DEATH(WorkGroup::create()->leave(), "leave without a matching enter");
 }
 

@@ -1,7 +1,7 @@
 #include "Daemon/Core/VSLUserIdentity.h"
 
 #include "Daemon/Core/VSLErrorCodes.h"
-#include "Daemon/Storage/VSLHomeDirectory.h"
+#include "Daemon/Storage/VSLFileManager.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
 
@@ -33,7 +33,7 @@ VSLUserIdentityRef VSLUserIdentity::create(uid_t uid, gid_t gid, std::string hom
 }
 
 VSLUserIdentityRef VSLUserIdentity::legacyMobile() {
-    return create(501, 501, homeDirectoryURLForPOSIXUID(501), std::nullopt, kVSLPersonaTypePersonal, 501);
+    return create(501, 501, VSLFileManager::homeDirectoryURLForPOSIXUID(501), std::nullopt, kVSLPersonaTypePersonal, 501);
 }
 
 namespace {
@@ -186,7 +186,7 @@ VSLUserIdentityRef defaultUserIdentity() {
         auto mobile = passwordEntryForName("mobile");
         uid_t uid = mobile ? mobile->uid : 0;
         gid_t gid = mobile ? mobile->gid : 0;
-        identity = VSLUserIdentity::create(uid, gid, homeDirectoryURLForPOSIXUID(uid), std::nullopt,
+        identity = VSLUserIdentity::create(uid, gid, VSLFileManager::homeDirectoryURLForPOSIXUID(uid), std::nullopt,
                                            kVSLPersonaTypePersonal, static_cast<int32_t>(uid));
     });
     return identity;

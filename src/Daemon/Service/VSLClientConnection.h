@@ -1,0 +1,75 @@
+// What one caller may do in one request, and the client-facing container
+// operations. One per message (or per piece of the daemon's own work).
+#pragma once
+
+#include <map>
+#include <memory>
+#include <mutex>
+#include <optional>
+#include <set>
+#include <string>
+#include <vector>
+
+#include "Daemon/Concurrency/VSLCommandQueue.h"
+#include "Daemon/Service/VSLClientIdentity.h"
+#include "Platform/WorkQueue.h"
+
+namespace vsl {
+
+class VSLUserIdentityCache;
+class VSLClientConnection;
+using VSLClientConnectionRef = std::shared_ptr<VSLClientConnection>;
+
+class VSLClientConnection {
+public:
+    static VSLClientConnectionRef create(VSLClientIdentityRef clientIdentity, bool entitled, bool allowOtherIdLookup,
+                                         bool unrestricted, std::optional<Value> lookup,
+                                         std::optional<std::vector<std::string>> entitledWipeIdentifiers,
+                                         std::shared_ptr<VSLCommandQueue> commandQueue);
+    // The daemon's own connection: anonymous privileged identity, entitled and unrestricted.
+    static VSLClientConnectionRef createPrivileged();
+    static VSLClientConnectionRef privilegedClientConnectionWithUserIdentity(VSLUserIdentityRef userIdentity,
+                                                                             bool kernel = false);
+    static VSLClientConnectionRef sharedClientConnection();
+
+    const VSLClientIdentityRef& clientIdentity() const { return clientIdentity_; }
+    std::string clientBundleIdentifier() const;
+    const std::shared_ptr<VSLCommandQueue>& commandQueue() const { return commandQueue_; }
+    const std::optional<Value>& lookup() const { return lookup_; }
+    const std::optional<std::vector<std::string>>& entitledWipeIdentifiers() const { return wipeIdentifiers_; }
+    std::shared_ptr<VSLUserIdentityCache> userIdentityCache() const;
+    static const std::shared_ptr<WorkQueue>& backgroundQueue();
+
+    bool entitled() const { return entitled_; }
+    bool allowOtherIdLookup() const { return allowOtherIdLookup_; }
+    bool allowGroupIdLookup() const { return allowGroupIdLookup_; }
+    bool unrestricted() const { return unrestricted_; }
+    void setEntitled(bool v) { entitled_ = v; }
+    void setAllowOtherIdLookup(bool v) { allowOtherIdLookup_ = v; }
+    void setAllowGroupIdLookup(bool v) { allowGroupIdLookup_ = v; }
+    void setUnrestricted(bool v) { unrestricted_ = v; }
+
+    bool isEntitledForLookupWithClass(VSLContainerClass c, const std::string& identifier);
+    // The checked lookup set of a class; none for a class without a short name.
+    std::optional<std::set<std::string>> lookupForContainerClass(VSLContainerClass c);
+
+    // Runs the queued commands until the queue is empty or one fails.
+    bool completeWithError(uint64_t* code);
+
+private:
+    VSLClientConnection() = default;
+
+    VSLClientIdentityRef clientIdentity_;
+    std::shared_ptr<VSLCommandQueue> commandQueue_;
+    std::optional<Value> lookup_;
+    std::optional<std::vector<std::string>> wipeIdentifiers_;
+    bool entitled_ = false;
+    bool allowOtherIdLookup_ = false;
+    bool allowGroupIdLookup_ = false;
+    bool unrestricted_ = false;
+
+    std::mutex mutex_;  // creates the sanitized lookup
+    std::shared_ptr<std::pair<std::mutex, std::map<std::string, std::set<std::string>>>> sanitizedLookup_;
+};
+
+}  // namespace vsl

@@ -1,0 +1,71 @@
+#include "Daemon/Service/VSLCommandTable.h"
+
+#include "Client/VSLProtocol.h"
+#include "Daemon/Core/VSLErrorCodes.h"
+#include "Daemon/Service/VSLEntitlements.h"
+#include "Daemon/Service/VSLRequestDecoding.h"
+#include "Platform/Log.h"
+
+namespace vsl {
+
+namespace {
+
+void retiredCommand(const Value&, const VSLReplyRef&, const VSLClientConnectionRef&, uint64_t* code) {
+    *code = kVSLErrorInvalidCommand;
+}
+
+constexpr const char* A = kVSLEntitlementAllowed;
+
+const VSLCommandRow kCommands[kVSLCommandCount] = {
+    {0, nullptr, A, 0x10101},
+    {1, nullptr, A, 0x10001},
+    {2, nullptr, A, 0x1},
+    {3, nullptr, A, 0x1},
+    {4, nullptr, kVSLEntitlementUserManagedAssets, 0x0},
+    {5, nullptr, A, 0x1},
+    {6, nullptr, A, 0x1},
+    {7, nullptr, A, 0x1},
+    {8, nullptr, A, 0x1},
+    {9, nullptr, A, 0x1},
+    {10, nullptr, A, 0x1},
+    {11, nullptr, kVSLEntitlementWipeContainer, 0x1},
+    {12, nullptr, kVSLEntitlementDeleteContainerContent, 0x1},
+    {13, nullptr, A, 0x10101},
+    {14, nullptr, A, 0x10001},
+    {15, nullptr, A, 0x10101},
+    {16, nullptr, A, 0x10101},
+    {17, nullptr, A, 0x10101},
+    {18, nullptr, A, 0x1},
+    {19, nullptr, A, 0x1},
+    {20, nullptr, A, 0x1},
+    {21, nullptr, A, 0x0},
+    {22, nullptr, A, 0x1},
+    {23, nullptr, A, 0x10001},
+    {24, nullptr, kVSLEntitlementDataMigration, 0x1},
+    {25, nullptr, kVSLEntitlementTestability, 0x1},
+    {26, nullptr, kVSLEntitlementStageSharedContent, 0x1},
+    {27, retiredCommand, A, 0x1},
+    {28, nullptr, kVSLEntitlementUserManagedAssets, 0x101},
+    {29, nullptr, kVSLEntitlementUserManagedAssets, 0x1},
+    {30, nullptr, kVSLEntitlementDataMigration, 0x1},
+    {31, nullptr, kVSLEntitlementTestability, 0x1},
+    {32, listAccessiblePersonas, A, 0x10101},
+};
+
+}  // namespace
+
+const VSLCommandRow& commandRow(uint64_t index) { return kCommands[index]; }
+
+size_t validateCommandTable() {
+    static_assert(kVSLProtocolCommandCount == kVSLCommandCount, "protocol and table disagree");
+    size_t bad = 0;
+    for (uint64_t i = 0; i < kVSLCommandCount; i++) {
+        if (kCommands[i].number != i) {
+            LogWrite(kLogLevelError, "validateCommandTable", "Invalid command at index %llu", i);
+            bad++;
+        }
+    }
+    return bad;
+}
+
+}  // namespace vsl

@@ -1,0 +1,121 @@
+#include "Daemon/Service/VSLProcessIPCEvent.h"
+
+#include "Client/VSLProtocol.h"
+#include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
+#include "Daemon/Core/VSLErrorCodes.h"
+#include "Daemon/Service/VSLCommandTable.h"
+#include "Daemon/Service/VSLEntitlements.h"
+#include "Platform/Log.h"
+
+namespace vsl {
+
+namespace {
+
+const char* const kFn = "VSLProcessIPCEvent";
+const char* const kRightsFn = "checkEntitlementsAndInitClientObject";
+
+VSLClientConnectionRef checkEntitlementsAndInitClientObject(const VSLPeerCredentials& peer, const VSLCommandRow& row) {
+    auto commandQueue = VSLCommandQueue::create();
+    auto identity = VSLClientIdentity::clientIdentityWithIPCConnection(peer);
+    if (!identity) {
+        if (row.flags & kVSLCommandFlagAllowUnentitled)
+            return VSLClientConnection::create(nullptr, false, false, false, std::nullopt, std::nullopt, commandQueue);
+        return nullptr;
+    }
+
+    bool allowOtherIdLookup = false;
+    bool unrestricted = false;
+    std::optional<Value> lookup;
+    if (identity->boolValueOfEntitlement(kVSLEntitlementAllowed)) {
+        allowOtherIdLookup = true;
+        unrestricted = std::string_view(row.entitlement) != kVSLEntitlementTestability;
+    } else {
+        allowOtherIdLookup = identity->boolValueOfEntitlement(kVSLEntitlementOtherIdLookup);
+        const Value* l = identity->entitlement(kVSLEntitlementLookup);
+        if ((row.flags & kVSLCommandFlagLookupDictionary) && l && l->isDictionary()) lookup = *l;
+    }
+
+    bool entitled = false;
+    std::optional<std::vector<std::string>> wipeList;
+    if (std::string_view(row.entitlement) == kVSLEntitlementWipeContainer) {
+        const Value* wipe = identity->entitlement(kVSLEntitlementWipeContainer);
+        if (wipe && wipe->arrayValue()) {
+            entitled = true;
+            wipeList.emplace();
+            for (const Value& v : *wipe->arrayValue())
+                if (v.stringValue()) wipeList->push_back(*v.stringValue());
+        } else {
+            LogWrite(kLogLevelError, kRightsFn, "No entitled containers to wipe");
+            entitled = unrestricted;
+        }
+    } else {
+        entitled = unrestricted || identity->boolValueOfEntitlement(row.entitlement);
+    }
+
+    if (entitled || (row.flags & kVSLCommandFlagAllowUnentitled) || lookup) {
+        uint64_t rc = VSLCodeSigningMapping::sharedInstance()->processCallerRegisteredEntitlements(
+            identity->entitlements(), identity->bundleIdentifier(), commandQueue);
+        if (rc != kVSLSuccess)
+            LogWrite(kLogLevelError, kRightsFn, "Error processing entitlements for %@ : %llu",
+                     identity->bundleIdentifier(), rc);
+        return VSLClientConnection::create(identity, entitled, allowOtherIdLookup, unrestricted, std::move(lookup),
+                                           std::move(wipeList), commandQueue);
+    }
+    LogWrite(kLogLevelError, kRightsFn, "connection attempt from pid %d (%@) is not entitled", peer.pid,
+             identity->bundleIdentifier());
+    return nullptr;
+}
+
+}  // namespace
+
+void VSLProcessIPCEvent(const VSLPeerCredentials& peer, const Value& request, VSLReply::Sender send,
+                        const std::function<void()>& cancelPeer) {
+    // A "Command" of any other type reads as absent, i.e. 0.
+    const Value* c = request.find("Command");
+    uint64_t command = c && c->uint64Value() ? *c->uint64Value() : 0;
+
+    if (!send) {
+        LogWrite(kLogLevelError, kFn, "Dictionary does not have reply context");
+        if (cancelPeer) cancelPeer();
+        return;
+    }
+    auto reply = std::make_shared<VSLReply>(std::move(send));
+    SignpostInterval interval(LogCategory::Ipc, "IPCEventProcessing", " command=%{public, signpost.description:attribute}llu ",
+                              command);
+    uint64_t code = kVSLSuccess;
+    uint64_t flags = kVSLCommandFlagReplyOnReturn;
+    VSLClientConnectionRef connection;
+
+    if (command >= kVSLCommandCount) {
+        LogWrite(kLogLevelError, kFn, "Invalid command index: %lld", static_cast<long long>(command));
+        code = kVSLErrorInvalidCommand;
+    } else if (commandRow(command).number != command) {
+        LogWrite(kLogLevelError, kFn, "Invalid command at index %llu", command);
+        code = kVSLErrorInvalidCommand;
+    } else {
+        const VSLCommandRow& row = commandRow(command);
+        flags = row.flags;
+        connection = checkEntitlementsAndInitClientObject(peer, row);
+        if (!connection) {
+            code = kVSLErrorNotEntitled;
+        } else if (!row.handler) {
+            LogWrite(kLogLevelError, kFn, "Command %llu (%s) is not available in this build", command, commandName(command));
+            code = kVSLErrorInvalidCommand;
+        } else {
+            row.handler(request, reply, connection, &code);
+            connection->completeWithError(&code);
+        }
+    }
+
+    std::string client = connection && connection->clientIdentity() ? connection->clientBundleIdentifier()
+                                                                     : std::string("<unknown>");
+    interval.end(" command=%{public, signpost.description:attribute}llu  clientIdentifier=%{private, "
+                 "signpost.description:attribute}@ ",
+                 command, client);
+    osLog(LogCategory::Ipc, OSLogLevel::Default, "command=%llu, client=%@, error=%llu", command, client, code);
+    connection.reset();
+
+    if ((flags & kVSLCommandFlagReplyOnReturn) || code != kVSLSuccess) reply->sendWithCode(code);
+}
+
+}  // namespace vsl

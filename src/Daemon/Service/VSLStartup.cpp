@@ -1,0 +1,53 @@
+#include "Daemon/Service/VSLStartup.h"
+
+#include <syslog.h>
+
+#include <cstdlib>
+
+#include "Daemon/Service/VSLClientConnection.h"
+#include "Daemon/Service/VSLCommandTable.h"
+#include "Platform/CrashAnnotation.h"
+#include "Platform/DeviceFacts.h"
+#include "Platform/Log.h"
+#include "Platform/SystemRoot.h"
+
+namespace vsl {
+
+const std::shared_ptr<WorkQueue>& deathRowQueue() {
+    static const auto queue = WorkQueue::serial("com.tarrow.vesseld.deathrow", QueuePriority::Background);
+    return queue;
+}
+
+const std::shared_ptr<WorkQueue>& lockStateQueue() {
+    static const auto queue = WorkQueue::serial("com.tarrow.vesseld.lockstate");
+    return queue;
+}
+
+void vesseld_init(std::shared_ptr<Transaction> transaction) {
+    SignpostInterval interval(LogCategory::Ipc, "StartingUp", "");
+    bool internal = deviceFacts().internalBuild;
+
+    LogFileOptions options;
+    options.directory = rootedPath("/private/var/root/Library/Logs/Vesselry");
+    options.maxBytes = internal ? 262144 : 102400;
+    options.rotatedFiles = internal ? 4 : 1;
+    if (!openLogFile(options)) {
+        std::string path = joinPath(options.directory, options.name);
+        syslog(LOG_ERR, "Failed to set up rotating logs at path %s", path.c_str());
+    }
+    setCrashAnnotationFile(joinPath(options.directory, "vesseld.crash"));
+    LogWrite(kLogLevelDebug, "vesseld_init", "vesseld built at %s %s started", __DATE__, __TIME__);
+
+    if (!deathRowQueue() || !lockStateQueue()) {
+        LogWrite(kLogLevelError, "vesseld_init", "Can't create dispatch queues.");
+        std::abort();
+    }
+    if (validateCommandTable() != 0)
+        LogWrite(kLogLevelError, "vesseld_init", "The command table is inconsistent; affected commands answer 49");
+    VSLClientConnection::sharedClientConnection();
+
+    interval.end("");
+    transaction->close();
+}
+
+}  // namespace vsl

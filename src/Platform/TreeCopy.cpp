@@ -1,0 +1,227 @@
+#include "Platform/TreeCopy.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <sys/xattr.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <vector>
+
+#include "Platform/DirectoryEntries.h"
+#include "Platform/DurableIO.h"
+#include "Platform/SystemRoot.h"
+
+namespace vsl {
+
+namespace {
+
+const char* const kAccessAclName = "system.posix_acl_access";
+const char* const kDefaultAclName = "system.posix_acl_default";
+
+class Fd {
+public:
+    explicit Fd(int fd = -1) : fd_(fd) {}
+    ~Fd() {
+        if (fd_ >= 0) ::close(fd_);
+    }
+    Fd(const Fd&) = delete;
+    Fd& operator=(const Fd&) = delete;
+    int get() const { return fd_; }
+    int* out() { return &fd_; }
+
+private:
+    int fd_;
+};
+
+bool unsupported(int err) { return err == ENOTSUP || err == EOPNOTSUPP; }
+
+// Whether `path` is `tree` or lies below it, by real paths: a copy into itself never ends.
+bool isWithin(const std::string& path, const std::string& tree) {
+    char* realTree = ::realpath(tree.c_str(), nullptr);
+    char* realParent = ::realpath(parentPath(path).c_str(), nullptr);
+    bool within = false;
+    if (realTree && realParent) {
+        std::string p = joinPath(realParent, lastPathComponent(path)), t = realTree;
+        within = p == t || (p.size() > t.size() && p.compare(0, t.size(), t) == 0 && (t == "/" || p[t.size()] == '/'));
+    }
+    std::free(realTree);
+    std::free(realParent);
+    return within;
+}
+
+class TreeCopier {
+public:
+    explicit TreeCopier(std::string* failedPath) : failedPath_(failedPath), asRoot_(::geteuid() == 0) {}
+
+    int copyTop(const std::string& from, const std::string& to) {
+        Fd srcDir(::open(parentPath(from).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        if (srcDir.get() < 0) return fail(errno, from);
+        Fd dstDir(::open(parentPath(to).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        if (dstDir.get() < 0) return fail(errno, to);
+        if (isWithin(to, from)) return fail(EINVAL, to);
+        std::string srcName = lastPathComponent(from), dstName = lastPathComponent(to);
+        struct stat st;
+        if (::fstatat(srcDir.get(), srcName.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) return fail(errno, from);
+        // Only the top item can inherit a default ACL of the destination: the copy's own
+        // directories get theirs after their contents are made.
+        char probe;
+        stripInheritedAcl_ = ::fgetxattr(dstDir.get(), kDefaultAclName, &probe, 0) > 0;
+        return copyEntry(srcDir.get(), srcName.c_str(), st, dstDir.get(), dstName.c_str(), from, to);
+    }
+
+private:
+    int fail(int err, const std::string& path) {
+        if (failedPath_) *failedPath_ = path;
+        return err;
+    }
+
+    int copyEntry(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
+                  const std::string& from, const std::string& to) {
+        if (S_ISDIR(st.st_mode)) return copyDirectory(srcDir, srcName, st, dstDir, dstName, from, to);
+        if (S_ISREG(st.st_mode)) return copyFile(srcDir, srcName, st, dstDir, dstName, from, to);
+        return copySpecial(srcDir, srcName, st, dstDir, dstName, from, to);
+    }
+
+    // Makes the item with `make`, replacing a non-directory that stands in the way.
+    template <class Make>
+    int makeReplacing(int dstDir, const char* dstName, const std::string& to, Make make) {
+        int rc = make();
+        if (rc != EEXIST) return rc;
+        struct stat existing;
+        if (::fstatat(dstDir, dstName, &existing, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+        if (S_ISDIR(existing.st_mode)) return EEXIST;
+        if (int r = durable::removeAt(dstDir, dstName, false, to)) return r;
+        return make();
+    }
+
+    int copyFile(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
+                 const std::string& from, const std::string& to) {
+        Fd src(::openat(srcDir, srcName, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+        if (src.get() < 0) return fail(errno, from);
+        Fd dst;
+        int rc = makeReplacing(dstDir, dstName, to,
+                               [&] { return durable::createFileAt(dstDir, dstName, 0600, to, dst.out()); });
+        if (rc) return fail(rc, to);
+        if ((rc = durable::copyFileData(src.get(), dst.get(), st.st_size, to, &method_))) return fail(rc, to);
+        return copyAttributes(src.get(), dst.get(), st, to);
+    }
+
+    int copyDirectory(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
+                      const std::string& from, const std::string& to) {
+        Fd src(::openat(srcDir, srcName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        if (src.get() < 0) return fail(errno, from);
+        int rc = durable::makeDirectoryAt(dstDir, dstName, 0700, to);
+        if (rc == EEXIST) {
+            struct stat existing;
+            if (::fstatat(dstDir, dstName, &existing, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(existing.st_mode)) rc = 0;
+        }
+        if (rc) return fail(rc, to);
+        Fd dst(::openat(dstDir, dstName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        if (dst.get() < 0) return fail(errno, to);
+        bool strip = stripInheritedAcl_;
+        stripInheritedAcl_ = false;
+        // An inherited default ACL must go before the contents are made, or they inherit it.
+        if (strip && (rc = removeAclXattr(dst.get(), kDefaultAclName, to))) return fail(rc, to);
+
+        std::vector<DirectoryEntry> entries;
+        if ((rc = readDirectoryEntries(src.get(), &entries))) return fail(rc, from);
+        for (const DirectoryEntry& e : entries) {
+            struct stat child;
+            if (::fstatat(src.get(), e.name.c_str(), &child, AT_SYMLINK_NOFOLLOW) != 0)
+                return fail(errno, joinPath(from, e.name));
+            if ((rc = copyEntry(src.get(), e.name.c_str(), child, dst.get(), e.name.c_str(), joinPath(from, e.name),
+                                joinPath(to, e.name))))
+                return rc;
+        }
+        stripInheritedAcl_ = strip;
+        return copyAttributes(src.get(), dst.get(), st, to);
+    }
+
+    int copySpecial(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
+                    const std::string& from, const std::string& to) {
+        int rc;
+        if (S_ISLNK(st.st_mode)) {
+            std::string target(static_cast<size_t>(st.st_size) + 1, '\0');
+            ssize_t n = ::readlinkat(srcDir, srcName, target.data(), target.size());
+            if (n < 0) return fail(errno, from);
+            target.resize(static_cast<size_t>(n));
+            rc = makeReplacing(dstDir, dstName, to, [&] { return durable::makeSymlinkAt(target, dstDir, dstName, to); });
+        } else {
+            rc = makeReplacing(dstDir, dstName, to,
+                               [&] { return durable::makeNodeAt(dstDir, dstName, st.st_mode, st.st_rdev, to); });
+        }
+        if (rc) return fail(rc, to);
+        // Links carry no mode, no ACL and (here) no extended attributes worth keeping.
+        if (asRoot_ && (rc = durable::changeOwnerAt(dstDir, dstName, st.st_uid, st.st_gid, to))) return fail(rc, to);
+        if (!S_ISLNK(st.st_mode)) {
+            Fd node(::openat(dstDir, dstName, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+            if (node.get() < 0) return fail(errno, to);
+            if ((rc = durable::changeModeOfNode(node.get(), to, st.st_mode & 07777))) return fail(rc, to);
+            if (stripInheritedAcl_ && (rc = removeAclXattr(node.get(), kAccessAclName, to))) return fail(rc, to);
+        }
+        struct timespec times[2] = {st.st_atim, st.st_mtim};
+        if ((rc = durable::setTimesAt(dstDir, dstName, times, to))) return fail(rc, to);
+        return 0;
+    }
+
+    // Owner before mode (a change of owner clears set-id bits), extended attributes
+    // (ACLs among them) after the mode, times last.
+    int copyAttributes(int src, int dst, const struct stat& st, const std::string& to) {
+        int rc;
+        if (asRoot_ && (rc = durable::changeOwnerOfNode(dst, to, st.st_uid, st.st_gid))) return fail(rc, to);
+        if ((rc = durable::changeModeOfNode(dst, to, st.st_mode & 07777))) return fail(rc, to);
+        if ((rc = copyXattrs(src, dst, to))) return fail(rc, to);
+        struct timespec times[2] = {st.st_atim, st.st_mtim};
+        if ((rc = durable::setTimesOfNode(dst, to, times))) return fail(rc, to);
+        return 0;
+    }
+
+    int copyXattrs(int src, int dst, const std::string& to) {
+        ssize_t len = ::flistxattr(src, nullptr, 0);
+        if (len < 0) return unsupported(errno) ? 0 : errno;
+        bool hadAccess = false, hadDefault = false;
+        if (len > 0) {
+            std::vector<char> names(static_cast<size_t>(len));
+            if ((len = ::flistxattr(src, names.data(), names.size())) < 0) return errno;
+            std::vector<char> value;
+            for (const char* name = names.data(); name < names.data() + len; name += std::strlen(name) + 1) {
+                ssize_t size = ::fgetxattr(src, name, nullptr, 0);
+                if (size < 0) return errno;
+                value.resize(static_cast<size_t>(size));
+                if (size > 0 && (size = ::fgetxattr(src, name, value.data(), value.size())) < 0) return errno;
+                int rc = durable::setXattr(dst, to, name, value.data(), static_cast<size_t>(size));
+                // The destination's file system may not hold this kind of attribute.
+                if (rc && !unsupported(rc)) return rc;
+                hadAccess |= std::strcmp(name, kAccessAclName) == 0;
+                hadDefault |= std::strcmp(name, kDefaultAclName) == 0;
+            }
+        }
+        if (!stripInheritedAcl_) return 0;
+        if (int rc = hadAccess ? 0 : removeAclXattr(dst, kAccessAclName, to)) return rc;
+        return hadDefault ? 0 : removeAclXattr(dst, kDefaultAclName, to);
+    }
+
+    // Drops an ACL the item got from its parent rather than from the source; probes
+    // first so that the usual case, nothing inherited, writes nothing.
+    static int removeAclXattr(int fd, const char* name, const std::string& to) {
+        if (::getxattr(durable::descriptorPath(fd).c_str(), name, nullptr, 0) < 0) return 0;
+        int rc = durable::removeXattr(fd, to, name);
+        return rc == ENODATA || unsupported(rc) ? 0 : rc;
+    }
+
+    std::string* failedPath_;
+    bool asRoot_;
+    bool stripInheritedAcl_ = false;
+    durable::CopyMethod method_ = durable::CopyMethod::Clone;
+};
+
+}  // namespace
+
+int copyTree(const std::string& from, const std::string& to, std::string* failedPath) {
+    return TreeCopier(failedPath).copyTop(from, to);
+}
+
+}  // namespace vsl

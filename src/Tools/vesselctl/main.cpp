@@ -1,0 +1,117 @@
+// vesselctl: talks to vesseld.
+//   vesselctl [--root DIR | --socket PATH] [--json | --plist] [--timeout SECONDS] COMMAND [key=value ...]
+// COMMAND is a command name (see `vesselctl help`) or its number.
+#include <cstdio>
+#include <cstdlib>
+#include <string>
+
+#include "Client/VSLArguments.h"
+#include "Client/VSLConnection.h"
+#include "Client/VSLProtocol.h"
+#include "Platform/PropertyList.h"
+
+using namespace vsl;
+using namespace vsl::client;
+
+namespace {
+
+int usage(FILE* out) {
+    std::fprintf(out,
+                 "usage: vesselctl [--root DIR | --socket PATH] [--json | --plist] [--timeout SECONDS] COMMAND [key=value ...]\n"
+                 "\n"
+                 "Sends one command to vesseld and prints its reply. Values are typed by key\n"
+                 "(Identifier=com.example.app ContainerClass=2 CreateIfNecessary=true UUID=...);\n"
+                 "key:type=value names a type: str u64 i64 bool uuid null plist(=@FILE) u64s strs uuids.\n"
+                 "--json prints the reply as JSON, --plist as a binary property list.\n"
+                 "The root defaults to $VESSELD_ROOT or /. Exit status: 0 when ReplyError is 1,\n"
+                 "1 for any other result, 2 for a usage error, 3 when the daemon cannot be reached.\n"
+                 "\n"
+                 "commands:\n");
+    for (uint64_t i = 0; i < kVSLProtocolCommandCount; i++) std::fprintf(out, "  %2llu  %s\n", (unsigned long long)i, commandName(i));
+    return out == stdout ? 0 : 2;
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    std::string root = std::getenv("VESSELD_ROOT") ? std::getenv("VESSELD_ROOT") : "/";
+    std::string socketPath;
+    bool asJson = false;
+    bool asPlist = false;
+    long timeoutSeconds = 60;
+    int i = 1;
+    for (; i < argc; i++) {
+        std::string a = argv[i];
+        if (a == "--root" && i + 1 < argc) {
+            root = argv[++i];
+        } else if (a == "--socket" && i + 1 < argc) {
+            socketPath = argv[++i];
+        } else if (a == "--json") {
+            asJson = true;
+        } else if (a == "--plist") {
+            asPlist = true;
+        } else if (a == "--timeout" && i + 1 < argc) {
+            timeoutSeconds = std::strtol(argv[++i], nullptr, 10);
+        } else if (a == "-h" || a == "--help" || a == "help") {
+            return usage(stdout);
+        } else if (!a.empty() && a[0] == '-') {
+            std::fprintf(stderr, "vesselctl: unknown option %s\n", a.c_str());
+            return usage(stderr);
+        } else {
+            break;
+        }
+    }
+    if (i >= argc) return usage(stderr);
+
+    std::string name = argv[i++];
+    std::optional<uint64_t> number = commandNumberForName(name.c_str());
+    if (!number) {
+        char* end = nullptr;
+        unsigned long long n = std::strtoull(name.c_str(), &end, 10);
+        if (name.empty() || *end) {
+            std::fprintf(stderr, "vesselctl: unknown command \"%s\" (vesselctl help lists them)\n", name.c_str());
+            return 2;
+        }
+        number = n;
+    }
+    Dictionary request{{"Command", Value::uint64(*number)}};
+    for (; i < argc; i++) {
+        std::string error;
+        auto kv = parseArgument(argv[i], &error);
+        if (!kv) {
+            std::fprintf(stderr, "vesselctl: %s\n", error.c_str());
+            return 2;
+        }
+        request.insert_or_assign(kv->first, kv->second);
+    }
+
+    std::string error;
+    if (socketPath.empty()) socketPath = VSLConnection::socketPathForSystemRoot(root);
+    auto connection = VSLConnection::connect(socketPath, &error);
+    if (!connection) {
+        std::fprintf(stderr,
+                     "vesselctl: cannot reach vesseld at %s: %s\n"
+                     "  is it running? start one on a scratch root with: vesseld --root DIR --init\n",
+                     socketPath.c_str(), error.c_str());
+        return 3;
+    }
+    VSLReply reply = connection->sendRequest(Value::dictionary(std::move(request)),
+                                             std::chrono::milliseconds(timeoutSeconds * 1000));
+    if (!reply.ok()) {
+        std::fprintf(stderr, "vesselctl: %s: %s\n", statusName(reply.status), reply.error.c_str());
+        return 3;
+    }
+    if (asPlist) {
+        auto bytes = encodeBinaryPropertyList(reply.body, &error);
+        if (!bytes) {
+            std::fprintf(stderr, "vesselctl: reply cannot be written as a property list: %s\n", error.c_str());
+            return 3;
+        }
+        std::fwrite(bytes->data(), 1, bytes->size(), stdout);
+    } else if (asJson)
+        std::printf("%s\n", renderJson(reply.body).c_str());
+    else
+        std::printf("%s", renderHuman(reply.body).c_str());
+    const Value* code = reply.body.find("ReplyError");
+    return code && code->uint64Value() == 1u ? 0 : 1;
+}

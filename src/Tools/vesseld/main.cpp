@@ -1,0 +1,104 @@
+// vesseld: the container daemon.
+//   vesseld [--root DIR] [--init] [--debug]
+// --root (or VESSELD_ROOT) selects the system root; --init first lays down a default
+// configuration there so the daemon runs without privileges or set-up.
+#include <pthread.h>
+#include <signal.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <thread>
+
+#include "Daemon/Service/VSLService.h"
+#include "Daemon/Service/VSLStartup.h"
+#include "Platform/DeviceFacts.h"
+#include "Platform/Log.h"
+#include "Platform/SystemRoot.h"
+#include "Platform/Transaction.h"
+#include "Platform/WorkQueue.h"
+#include "ScratchRoot.h"
+
+using namespace vsl;
+
+namespace {
+
+void usage() {
+    std::fprintf(stderr, "usage: vesseld [--root DIR] [--init] [--debug]\n");
+}
+
+// Signals are taken by one thread so that no handler runs inside daemon code.
+void startSignalThread() {
+    sigset_t set;
+    sigemptyset(&set);
+    sigaddset(&set, SIGTERM);
+    sigaddset(&set, SIGINT);
+    pthread_sigmask(SIG_BLOCK, &set, nullptr);
+    std::thread([set] {
+        int sig = 0;
+        sigwait(&set, &sig);
+        stopMainLoop();
+    }).detach();
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    std::string root = std::getenv("VESSELD_ROOT") ? std::getenv("VESSELD_ROOT") : "/";
+    bool init = false;
+    for (int i = 1; i < argc; i++) {
+        std::string a = argv[i];
+        if (a == "--root" && i + 1 < argc) {
+            root = argv[++i];
+        } else if (a == "--init") {
+            init = true;
+        } else if (a == "--debug") {
+            setDebugLogging(true);
+        } else {
+            usage();
+            return 2;
+        }
+    }
+    signal(SIGPIPE, SIG_IGN);
+    if (init && ::mkdir(root.c_str(), 0755) != 0 && errno != EEXIST) {
+        std::fprintf(stderr, "vesseld: cannot create %s: %s\n", root.c_str(), std::strerror(errno));
+        return 1;
+    }
+    setSystemRoot(root);
+    if (init) {
+        std::string error;
+        if (!initializeScratchRoot(&error)) {
+            std::fprintf(stderr, "vesseld: --init failed: %s\n", error.c_str());
+            return 1;
+        }
+    }
+    reloadDeviceFacts();
+    startSignalThread();
+
+    auto listenerQueue = WorkQueue::serial("com.tarrow.vesseld.listener");
+    auto startup = std::make_shared<Transaction>("com.tarrow.vesseld.startup");
+    listenerQueue->async([startup] { vesseld_init(startup); });
+
+    std::string error;
+    auto service = VSLService::start(listenerQueue, &error);
+    if (!service) {
+        LogWrite(kLogLevelError, "main", "unable to start ipc service!");
+        std::fprintf(stderr, "vesseld: unable to start ipc service: %s\n", error.c_str());
+        // A second daemon on the same root must not linger without serving.
+        return 1;
+    }
+    std::fprintf(stderr, "vesseld: serving on %s\n", defaultIpcServicePath().c_str());
+
+    runMainLoop();
+
+    service->stop();
+    if (!waitForNoTransactions(std::chrono::seconds(3)))
+        LogWrite(kLogLevelNotice, "main", "Stopping with %llu transactions open", (unsigned long long)openTransactionCount());
+    closeLogFile();
+    return 0;
+}

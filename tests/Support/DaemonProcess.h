@@ -1,0 +1,63 @@
+// A real vesseld on a scratch system root, for end-to-end tests, and client
+// programs with identities of their own (copies of vesselctl registered in the
+// policy store under different signing identifiers).
+#pragma once
+
+#include <sys/types.h>
+
+#include <string>
+#include <vector>
+
+#include "Platform/Value.h"
+
+namespace vsl::test {
+
+std::string vesseldPath();
+std::string vesselctlPath();
+
+class DaemonProcess {
+public:
+    // Makes a scratch root (removed on destruction) and lays down the default
+    // configuration with `vesseld --init`-like files, without starting the daemon.
+    DaemonProcess();
+    ~DaemonProcess();
+    DaemonProcess(const DaemonProcess&) = delete;
+    DaemonProcess& operator=(const DaemonProcess&) = delete;
+
+    const std::string& root() const { return root_; }
+    std::string at(const std::string& relative) const;
+    std::string socketPath() const;
+
+    // Starts vesseld --root ROOT --init and waits until it answers. False on failure.
+    bool start(const std::vector<std::string>& extraEnvironment = {});
+    // SIGTERM and wait; returns the exit status (or -1).
+    int stop();
+    // SIGKILL and reap.
+    void kill();
+    pid_t pid() const { return pid_; }
+    bool running() const { return pid_ > 0; }
+
+    // Copies vesselctl into the root under `name` and registers it with the given
+    // signing identifier and entitlements. Returns the copy's path.
+    std::string addClient(const std::string& name, const std::string& signingIdentifier, const Value& entitlements,
+                          bool sandboxed = false);
+
+    struct CtlResult {
+        int exitCode = -1;
+        std::string out;
+        std::string err;
+        Value reply;  // parsed back from --json output when it was JSON we can read
+    };
+    // Runs a client program (a path from addClient, or vesselctlPath()) with --root.
+    CtlResult run(const std::string& client, const std::vector<std::string>& args) const;
+
+private:
+    std::string root_;
+    pid_t pid_ = -1;
+};
+
+// Runs a program, capturing stdout and stderr; returns the exit status.
+int runProgram(const std::vector<std::string>& argv, std::string* out, std::string* err,
+               const std::vector<std::string>& extraEnvironment = {});
+
+}  // namespace vsl::test
