@@ -244,7 +244,9 @@ struct UserManagement::State {
                 p += sizeof(inotify_event) + ev->len;
                 std::string name = ev->len ? ev->name : "";
                 std::lock_guard g(s->mutex);
-                if (ev->wd == s->directoryWatch && (ev->mask & IN_IGNORED)) {
+                if (ev->mask & IN_Q_OVERFLOW) {
+                    changed = true;  // events were lost: read the file anyway
+                } else if (ev->wd == s->directoryWatch && (ev->mask & IN_IGNORED)) {
                     // The directory went away: fall back to waiting for it.
                     s->directoryWatch = -1;
                     std::string ignored;

@@ -415,7 +415,9 @@ TEST(VSLLocks, DebugLogTellsTakesReleasesAndTheRecordsEnd) {
         events[name + " " + event]++;
         if (event == "begin") {
             open[record.signpostId] = name;
-            if (name == "ReadLockWithIdentifier") EXPECT_THAT(record.message, testing::HasSubstr("uuid=LOGGED"));
+            if (name == "ReadLockWithIdentifier") {
+                EXPECT_THAT(record.message, testing::HasSubstr("uuid=LOGGED"));
+            }
         } else {
             EXPECT_EQ(open[record.signpostId], name);
             open.erase(record.signpostId);

@@ -11,58 +11,58 @@
 
 namespace vsl::test {
 
-PersonaAttributes attributesFor(const PersonaSpec& spec) {
+PersonaAttributes attributesFor(const PersonaRow& row) {
     PersonaAttributes a;
-    a.isPersonal = spec.kind == Kind::Personal;
-    a.isEnterprise = spec.kind == Kind::Enterprise;
-    a.isUniversal = spec.kind == Kind::Universal;
-    a.isSystem = spec.kind == Kind::System;
-    a.uniqueString = spec.uniqueString;
-    a.kernelPersonaID = spec.kernelPersonaID;
-    a.uid = spec.uid;
-    if (spec.uid) a.gid = *spec.uid;
-    a.bundleIdentifiers = spec.bundles;
-    if (spec.home) a.layoutPath = rootedPath(*spec.home);
+    a.isPersonal = row.kind == Kind::Personal;
+    a.isEnterprise = row.kind == Kind::Enterprise;
+    a.isUniversal = row.kind == Kind::Universal;
+    a.isSystem = row.kind == Kind::System;
+    a.uniqueString = row.uniqueString;
+    a.kernelPersonaID = row.kernelPersonaID;
+    a.uid = row.uid;
+    if (row.uid) a.gid = *row.uid;
+    a.bundleIdentifiers = row.bundles;
+    if (row.home) a.layoutPath = rootedPath(*row.home);
     return a;
 }
 
-PersonaAttributesList attributesFor(const std::vector<PersonaSpec>& specs) {
+PersonaAttributesList attributesFor(const std::vector<PersonaRow>& rows) {
     PersonaAttributesList list;
-    for (const auto& s : specs) list.push_back(attributesFor(s));
+    for (const auto& s : rows) list.push_back(attributesFor(s));
     return list;
 }
 
-Value entryFor(const PersonaSpec& spec) {
-    uint64_t type = spec.kind == Kind::Personal ? 0 : spec.kind == Kind::Enterprise ? 1 : 2;
-    Dictionary d{{"PersonaType", Value::uint64(type)}, {"KernelPersonaID", Value::uint64(spec.kernelPersonaID)}};
-    if (spec.kind == Kind::Universal) d["Universal"] = Value::boolean(true);
-    if (spec.kind == Kind::System) d["System"] = Value::boolean(true);
-    if (spec.uniqueString) d["PersonaUniqueString"] = Value::string(*spec.uniqueString);
-    if (spec.uid) {
-        d["UID"] = Value::uint64(*spec.uid);
-        d["GID"] = Value::uint64(*spec.uid);
+Value entryFor(const PersonaRow& row) {
+    uint64_t type = row.kind == Kind::Personal ? 0 : row.kind == Kind::Enterprise ? 1 : 2;
+    Dictionary d{{"PersonaType", Value::uint64(type)}, {"KernelPersonaID", Value::uint64(row.kernelPersonaID)}};
+    if (row.kind == Kind::Universal) d["Universal"] = Value::boolean(true);
+    if (row.kind == Kind::System) d["System"] = Value::boolean(true);
+    if (row.uniqueString) d["PersonaUniqueString"] = Value::string(*row.uniqueString);
+    if (row.uid) {
+        d["UID"] = Value::uint64(*row.uid);
+        d["GID"] = Value::uint64(*row.uid);
     }
-    if (spec.home) d["HomeDirectory"] = Value::string(*spec.home);
+    if (row.home) d["HomeDirectory"] = Value::string(*row.home);
     Array bundles;
-    for (const auto& b : spec.bundles) bundles.push_back(Value::string(b));
+    for (const auto& b : row.bundles) bundles.push_back(Value::string(b));
     d["BundleIdentifiers"] = Value::array(std::move(bundles));
     return Value::dictionary(std::move(d));
 }
 
 namespace {
-std::string encoded(const std::vector<PersonaSpec>& specs) {
+std::string encoded(const std::vector<PersonaRow>& rows) {
     Array entries;
-    for (const auto& s : specs) entries.push_back(entryFor(s));
+    for (const auto& s : rows) entries.push_back(entryFor(s));
     return encodeBinaryPropertyList(Value::array(std::move(entries)), nullptr).value();
 }
 }  // namespace
 
-void writePersonas(const TempRoot& root, const std::vector<PersonaSpec>& specs) {
-    root.writeFile("etc/vesseld/personas.plist", encoded(specs));
+void writePersonas(const TempRoot& root, const std::vector<PersonaRow>& rows) {
+    root.writeFile("etc/vesseld/personas.plist", encoded(rows));
 }
 
-void replacePersonasAtomically(const TempRoot& root, const std::vector<PersonaSpec>& specs) {
-    root.writeFile("etc/vesseld/.personas.plist.new", encoded(specs));
+void replacePersonasAtomically(const TempRoot& root, const std::vector<PersonaRow>& rows) {
+    root.writeFile("etc/vesseld/.personas.plist.new", encoded(rows));
     std::rename(root.at("etc/vesseld/.personas.plist.new").c_str(), root.at("etc/vesseld/personas.plist").c_str());
 }
 
@@ -72,7 +72,7 @@ void makePersonasUnreadable(const TempRoot& root) {
         throw std::runtime_error("cannot replace personas.plist");
 }
 
-std::vector<PersonaSpec> standardPersonas() {
+std::vector<PersonaRow> standardPersonas() {
     return {
         {Kind::Personal, 1000, "P-1", {}, 501, std::nullopt},
         {Kind::Enterprise, 1001, "E-1", {"com.example.mail"}, 502, "/private/var/PersonaVolumes/E-1"},

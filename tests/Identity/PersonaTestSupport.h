@@ -18,7 +18,7 @@ namespace vsl::test {
 
 enum class Kind { Personal, Enterprise, Universal, System };
 
-struct PersonaSpec {
+struct PersonaRow {
     Kind kind;
     uint32_t kernelPersonaID;
     std::optional<std::string> uniqueString;
@@ -27,14 +27,14 @@ struct PersonaSpec {
     std::optional<std::string> home;  // as written in the file (inside the root)
 };
 
-PersonaAttributes attributesFor(const PersonaSpec& spec);
-PersonaAttributesList attributesFor(const std::vector<PersonaSpec>& specs);
-Value entryFor(const PersonaSpec& spec);
+PersonaAttributes attributesFor(const PersonaRow& row);
+PersonaAttributesList attributesFor(const std::vector<PersonaRow>& rows);
+Value entryFor(const PersonaRow& row);
 
 // Writes etc/vesseld/personas.plist in place (truncate and write).
-void writePersonas(const TempRoot& root, const std::vector<PersonaSpec>& specs);
+void writePersonas(const TempRoot& root, const std::vector<PersonaRow>& rows);
 // Writes a temporary file next to it and renames it over the name.
-void replacePersonasAtomically(const TempRoot& root, const std::vector<PersonaSpec>& specs);
+void replacePersonasAtomically(const TempRoot& root, const std::vector<PersonaRow>& rows);
 
 // Turns personas.plist into a link to its own directory in one rename, so that it is
 // unreadable without ever being missing.
@@ -42,7 +42,7 @@ void makePersonasUnreadable(const TempRoot& root);
 
 // Personal P-1 (uid 501), enterprise E-1 (uid 502) and E-2, universal U-1, a system
 // persona without a string, and an enterprise persona without one.
-std::vector<PersonaSpec> standardPersonas();
+std::vector<PersonaRow> standardPersonas();
 
 // LogWrite lines go to <dir>/vesseld.log while this lives.
 class LogCapture {

@@ -230,9 +230,9 @@ TEST(UserIdentityCache, RemovedEnterprisePersonaIsInvalidatedWhenTheFileChanges)
     cache->addObserver(observer);
     ASSERT_TRUE(cache->userIdentityForCurrentUserWithPersonaUniqueString("E-1"));
 
-    auto specs = standardPersonas();
-    specs.erase(specs.begin() + 1);  // E-1
-    writePersonas(root, specs);
+    auto rows = standardPersonas();
+    rows.erase(rows.begin() + 1);  // E-1
+    writePersonas(root, rows);
     // Every enterprise identity is flushed, not only the one that went away.
     ASSERT_TRUE(observer->waitFor({"E-1", "E-2"}));
     EXPECT_EQ((std::set<std::string>{"E-1", "E-2"}), observer->seen());

@@ -33,11 +33,11 @@ TEST(UserManagement, ReadsThePersonaFileAndFindsTheCallersPersona) {
     auto service = UserManagement::create();
     EXPECT_TRUE(service->allPersonas().empty()) << "no file means no personas";
 
-    auto specs = standardPersonas();
-    specs.push_back({Kind::Enterprise, 1004, "E-4", {}, 501, std::nullopt});  // shares the personal uid
-    writePersonas(root, specs);
+    auto rows = standardPersonas();
+    rows.push_back({Kind::Enterprise, 1004, "E-4", {}, 501, std::nullopt});  // shares the personal uid
+    writePersonas(root, rows);
     PersonaAttributesList list = service->allPersonas();
-    EXPECT_EQ(attributesFor(specs), list);
+    EXPECT_EQ(attributesFor(rows), list);
     ASSERT_EQ(7u, list.size());
     EXPECT_EQ(root.at("private/var/PersonaVolumes/E-1"), list[1].layoutPath) << "homes are inside the root";
     EXPECT_TRUE(list[3].isUniversal && !list[3].isSystem && !list[3].isPersonal);
@@ -118,19 +118,19 @@ TEST(UserManagement, WatcherTellsObserversAboutChangesUntilStopped) {
     auto observer = std::make_shared<CountingObserver>();
     ASSERT_EQ(std::nullopt, service->registerPersonaListObserver(observer, "com.tarrow.vesseld.personaobserver"));
 
-    auto specs = standardPersonas();
-    writePersonas(root, specs);
+    auto rows = standardPersonas();
+    writePersonas(root, rows);
     ASSERT_TRUE(observer->waitForCount(1)) << "directory and file created after registration";
-    EXPECT_EQ(attributesFor(specs), service->allPersonas());
+    EXPECT_EQ(attributesFor(rows), service->allPersonas());
 
-    specs.erase(specs.begin() + 1);
-    writePersonas(root, specs);
+    rows.erase(rows.begin() + 1);
+    writePersonas(root, rows);
     ASSERT_TRUE(observer->waitForCount(2)) << "rewritten in place";
 
-    specs.erase(specs.begin() + 1);
-    replacePersonasAtomically(root, specs);
+    rows.erase(rows.begin() + 1);
+    replacePersonasAtomically(root, rows);
     ASSERT_TRUE(observer->waitForCount(3)) << "renamed over";
-    EXPECT_EQ(attributesFor(specs), service->allPersonas());
+    EXPECT_EQ(attributesFor(rows), service->allPersonas());
 
     // An observer that is gone is skipped; destroying the service stops its watcher.
     observer.reset();

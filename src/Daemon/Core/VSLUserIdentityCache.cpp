@@ -20,7 +20,7 @@ const char* const kPersonaListTransactionName = "com.tarrow.vesseld.personaListD
 const char* const kResyncFunction = "-[VSLUserIdentityCache _lock_resync]";
 const char* const kRebuildFunction = "-[VSLUserIdentityCache _lock_resync_fromUserPersonaAttributes:]";
 // Attempts after the first; one second apart.
-constexpr unsigned long kResyncRetries = 59;
+constexpr unsigned long kResyncRetries = 60;
 
 std::string shortDescriptionOf(const VSLUserIdentityRef& identity) {
     return identity ? identity->shortDescription() : std::string("(null)");
@@ -427,7 +427,7 @@ bool VSLUserIdentityCache::lock_resyncFromUserPersonaAttributes(const PersonaAtt
         for (const auto& bundle : p.bundleIdentifiers) bundleMap[bundle].insert(identity);
         for (const auto& bundle : universalBundles) bundleMap[bundle].insert(identity);
     }
-
+    for (const auto& bundle : universalBundles) bundleMap[bundle].insert(personal);
 
     lock_bundleToEnterpriseIdentitiesMap_ = std::move(bundleMap);
     lock_personaUniqueStringToUserIdentityMap_ = std::move(byUniqueString);
