@@ -110,7 +110,7 @@ TEST(VSLLocks, WritersOfTheSameIdentifiersInAnyOrderNeverDeadlock) {
     std::atomic<int> overlaps{0};
     const std::vector<std::vector<std::string>> orders = {{"A", "B"}, {"B", "A"}, {"B", "A", "A", "B"}};
     runWorkers(3, [&](int worker, std::atomic<uint64_t>& progress) {
-        for (int i = 0; i < 20000; i++) {
+        for (int i = 0; i < 5000; i++) {
             lock_identifier_for_writing(orders[worker]);
             if (holdersA.fetch_add(1) != 0 || holdersB.fetch_add(1) != 0) overlaps++;
             std::this_thread::yield();
