@@ -44,7 +44,7 @@ Value reply() {
     return dict({{"ReplyError", Value::uint64(1)},
                  {"ReplyUUID", Value::uuid(Uuid::random())},
                  {"ReplyExisted", Value::boolean(true)},
-                 {"ReplyPath", Value::string("/private/var/mobile/Containers/Data/Application/" + std::string(100, 'p'))},
+                 {"ReplyPath", Value::string("/private/var/mobile/Containers/Data/Application/" + std::string(30, 'p'))},
                  {"ReplyIdentifier", Value::string("com.example.benchmark.application-" + std::string(60, 'x'))}});
 }
 

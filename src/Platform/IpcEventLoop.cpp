@@ -19,6 +19,9 @@ namespace {
 constexpr uint64_t kListenerKey = 0;
 constexpr uint64_t kWakeKey = 1;
 
+// Set while an I/O thread serves an event and has not yet counted itself idle again.
+thread_local bool tBusy = false;
+
 void armListener(int epollFd, int listenFd, int op) {
     epoll_event ev{};
     ev.events = EPOLLIN | EPOLLONESHOT;
@@ -77,6 +80,7 @@ void IpcEventLoop::threadMain() {
         }
         if (n < 0) continue;  // EINTR
         --idle_;
+        tBusy = true;
         // Whatever this event leads to may block; someone must keep listening.
         if (idle_ == 0 && threads_ < options_.maxIoThreads) spawnThreadLocked();
         std::shared_ptr<IpcPeer> peer;
@@ -87,6 +91,7 @@ void IpcEventLoop::threadMain() {
         lock.unlock();
         if (ev.data.u64 == kListenerKey) {
             acceptAll();
+            willBeIdle();
             armListener(epollFd_, listenFd_, EPOLL_CTL_MOD);
         } else if (peer) {
             // Inline on this thread when the peer's queue is free.
@@ -94,7 +99,8 @@ void IpcEventLoop::threadMain() {
         }
         peer.reset();
         lock.lock();
-        ++idle_;
+        if (tBusy) ++idle_;
+        tBusy = false;
     }
     --idle_;
     --threads_;
@@ -159,6 +165,13 @@ void IpcEventLoop::admit(int fd) {
     } else {
         welcome();
     }
+}
+
+void IpcEventLoop::willBeIdle() {
+    if (!tBusy) return;  // not an I/O thread, or already counted
+    tBusy = false;
+    std::lock_guard lock(mutex_);
+    ++idle_;
 }
 
 void IpcEventLoop::forget(uint64_t serial) {

@@ -29,6 +29,10 @@ public:
     const IpcServerOptions& options() const { return options_; }
     int epollFd() const { return epollFd_; }
     void forget(uint64_t serial);
+    // Called by an I/O thread just before it rearms what it served: it counts as
+    // idle from then on, so the event the rearm may fire at once does not make
+    // another thread think everybody is busy.
+    void willBeIdle();
     size_t peerCount() const;
     size_t threadCount() const;
 

@@ -64,6 +64,7 @@ void IpcPeer::service() {
     }
     bool open = why == nullptr;
     if (open && outboxEmpty()) open = readAndHandle(&why);
+    if (open) loop_->willBeIdle();
     std::unique_lock lock(mutex_);
     if (!open) {
         const bool closing = markClosedLocked(why);

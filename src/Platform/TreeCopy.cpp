@@ -6,6 +6,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <cstdio>
 #include <cstdlib>
 #include <cstring>
 #include <vector>
@@ -54,7 +55,8 @@ bool isWithin(const std::string& path, const std::string& tree) {
 
 class TreeCopier {
 public:
-    explicit TreeCopier(std::string* failedPath) : failedPath_(failedPath), asRoot_(::geteuid() == 0) {}
+    explicit TreeCopier(std::string* failedPath)
+        : failedPath_(failedPath), euid_(::geteuid()), egid_(::getegid()), umask_(processUmask()) {}
 
     int copyTop(const std::string& from, const std::string& to) {
         Fd srcDir(::open(parentPath(from).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
@@ -69,7 +71,9 @@ public:
         // directories get theirs after their contents are made.
         char probe;
         stripInheritedAcl_ = ::fgetxattr(dstDir.get(), kDefaultAclName, &probe, 0) > 0;
-        return copyEntry(srcDir.get(), srcName.c_str(), st, dstDir.get(), dstName.c_str(), from, to);
+        // What is made in the caller's directory may take its group or ACL; below, only
+        // what this copy made holds the new items.
+        return copyEntry(srcDir.get(), srcName.c_str(), st, dstDir.get(), dstName.c_str(), from, to, false);
     }
 
 private:
@@ -78,11 +82,29 @@ private:
         return err;
     }
 
+    // The umask, to know when a new file is born with its final mode; -1 when unknown.
+    static int processUmask() {
+        FILE* f = std::fopen("/proc/self/status", "re");
+        if (!f) return -1;
+        char line[256];
+        int mask = -1;
+        while (std::fgets(line, sizeof line, f))
+            if (std::sscanf(line, "Umask: %o", &mask) == 1) break;
+        std::fclose(f);
+        return mask;
+    }
+
+    // `parentIsOurs`: `dstDir` was made by this copy, so a new item in it is owned by
+    // this process and gets its mode from the umask alone.
     int copyEntry(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
-                  const std::string& from, const std::string& to) {
-        if (S_ISDIR(st.st_mode)) return copyDirectory(srcDir, srcName, st, dstDir, dstName, from, to);
-        if (S_ISREG(st.st_mode)) return copyFile(srcDir, srcName, st, dstDir, dstName, from, to);
+                  const std::string& from, const std::string& to, bool parentIsOurs) {
+        if (S_ISDIR(st.st_mode)) return copyDirectory(srcDir, srcName, st, dstDir, dstName, from, to, parentIsOurs);
+        if (S_ISREG(st.st_mode)) return copyFile(srcDir, srcName, st, dstDir, dstName, from, to, parentIsOurs);
         return copySpecial(srcDir, srcName, st, dstDir, dstName, from, to);
+    }
+
+    bool ownerMatches(const struct stat& st, bool parentIsOurs) const {
+        return parentIsOurs && st.st_uid == euid_ && st.st_gid == egid_;
     }
 
     // Makes the item with `make`, replacing a non-directory that stands in the way.
@@ -98,22 +120,26 @@ private:
     }
 
     int copyFile(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
-                 const std::string& from, const std::string& to) {
+                 const std::string& from, const std::string& to, bool parentIsOurs) {
         Fd src(::openat(srcDir, srcName, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
         if (src.get() < 0) return fail(errno, from);
+        mode_t mode = st.st_mode & 07777;
+        // Born with its final mode when nothing (umask, set-id bits) can change it.
+        bool exact = parentIsOurs && umask_ >= 0 && (mode & 07000) == 0 && (mode & ~static_cast<mode_t>(umask_)) == mode;
         Fd dst;
         int rc = makeReplacing(dstDir, dstName, to,
-                               [&] { return durable::createFileAt(dstDir, dstName, 0600, to, dst.out()); });
+                               [&] { return durable::createFileAt(dstDir, dstName, exact ? mode : 0600, to, dst.out()); });
         if (rc) return fail(rc, to);
         if ((rc = durable::copyFileData(src.get(), dst.get(), st.st_size, to, &method_))) return fail(rc, to);
-        return copyAttributes(src.get(), dst.get(), st, to);
+        return copyAttributes(src.get(), dst.get(), st, to, ownerMatches(st, parentIsOurs), exact);
     }
 
     int copyDirectory(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
-                      const std::string& from, const std::string& to) {
+                      const std::string& from, const std::string& to, bool parentIsOurs) {
         Fd src(::openat(srcDir, srcName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
         if (src.get() < 0) return fail(errno, from);
         int rc = durable::makeDirectoryAt(dstDir, dstName, 0700, to);
+        bool made = rc == 0;
         if (rc == EEXIST) {
             struct stat existing;
             if (::fstatat(dstDir, dstName, &existing, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(existing.st_mode)) rc = 0;
@@ -125,6 +151,9 @@ private:
         stripInheritedAcl_ = false;
         // An inherited default ACL must go before the contents are made, or they inherit it.
         if (strip && (rc = removeAclXattr(dst.get(), kDefaultAclName, to))) return fail(rc, to);
+        // A set-group-id directory (inherited from the caller's) hands its group on.
+        struct stat madeStat;
+        bool childrenOurs = made && ::fstat(dst.get(), &madeStat) == 0 && !(madeStat.st_mode & S_ISGID);
 
         std::vector<DirectoryEntry> entries;
         if ((rc = readDirectoryEntries(src.get(), &entries))) return fail(rc, from);
@@ -133,11 +162,11 @@ private:
             if (::fstatat(src.get(), e.name.c_str(), &child, AT_SYMLINK_NOFOLLOW) != 0)
                 return fail(errno, joinPath(from, e.name));
             if ((rc = copyEntry(src.get(), e.name.c_str(), child, dst.get(), e.name.c_str(), joinPath(from, e.name),
-                                joinPath(to, e.name))))
+                                joinPath(to, e.name), childrenOurs)))
                 return rc;
         }
         stripInheritedAcl_ = strip;
-        return copyAttributes(src.get(), dst.get(), st, to);
+        return copyAttributes(src.get(), dst.get(), st, to, made && ownerMatches(st, parentIsOurs), false);
     }
 
     int copySpecial(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
@@ -155,7 +184,7 @@ private:
         }
         if (rc) return fail(rc, to);
         // Links carry no mode, no ACL and (here) no extended attributes worth keeping.
-        if (asRoot_ && (rc = durable::changeOwnerAt(dstDir, dstName, st.st_uid, st.st_gid, to))) return fail(rc, to);
+        if (euid_ == 0 && (rc = durable::changeOwnerAt(dstDir, dstName, st.st_uid, st.st_gid, to))) return fail(rc, to);
         if (!S_ISLNK(st.st_mode)) {
             Fd node(::openat(dstDir, dstName, O_PATH | O_NOFOLLOW | O_CLOEXEC));
             if (node.get() < 0) return fail(errno, to);
@@ -168,11 +197,14 @@ private:
     }
 
     // Owner before mode (a change of owner clears set-id bits), extended attributes
-    // (ACLs among them) after the mode, times last.
-    int copyAttributes(int src, int dst, const struct stat& st, const std::string& to) {
+    // (ACLs among them) after the mode, times last. What the new item already has is
+    // not written again.
+    int copyAttributes(int src, int dst, const struct stat& st, const std::string& to, bool ownerIsRight,
+                       bool modeIsRight) {
         int rc;
-        if (asRoot_ && (rc = durable::changeOwnerOfNode(dst, to, st.st_uid, st.st_gid))) return fail(rc, to);
-        if ((rc = durable::changeModeOfNode(dst, to, st.st_mode & 07777))) return fail(rc, to);
+        if (euid_ == 0 && !ownerIsRight && (rc = durable::changeOwnerOfNode(dst, to, st.st_uid, st.st_gid)))
+            return fail(rc, to);
+        if (!modeIsRight && (rc = durable::changeModeOfNode(dst, to, st.st_mode & 07777))) return fail(rc, to);
         if ((rc = copyXattrs(src, dst, to))) return fail(rc, to);
         struct timespec times[2] = {st.st_atim, st.st_mtim};
         if ((rc = durable::setTimesOfNode(dst, to, times))) return fail(rc, to);
@@ -213,7 +245,9 @@ private:
     }
 
     std::string* failedPath_;
-    bool asRoot_;
+    uid_t euid_;
+    gid_t egid_;
+    int umask_;
     bool stripInheritedAcl_ = false;
     durable::CopyMethod method_ = durable::CopyMethod::Clone;
 };

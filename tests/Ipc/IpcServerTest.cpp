@@ -299,6 +299,26 @@ TEST_F(IpcServerTest, OwnsItsSocketFile) {
     EXPECT_EQ(readFile(path_), "precious");
 }
 
+TEST_F(IpcServerTest, ServesAnInheritedListeningSocket) {
+    ::mkdir((dir_ + "/run").c_str(), 0755);
+    ::mkdir((dir_ + "/run/vesseld").c_str(), 0755);
+    int listener = -1;
+    leaveStaleSocket(path_, true, &listener);
+    IpcServerOptions options;
+    options.listenFd = listener;  // as a service manager would hand it over
+    options.onMessage = [](std::shared_ptr<IpcPeer> peer, IpcMessage m) { peer->sendReply(m.id, echoOf(m)); };
+    auto server = IpcServer::start(std::move(options));
+    ASSERT_TRUE(server);
+    auto conn = connect();
+    ASSERT_TRUE(conn);
+    auto reply = conn->sendRequest(dict({{"x", Value::uint64(1)}}));
+    ASSERT_TRUE(reply.ok()) << reply.error;
+    // The file belongs to whoever made the socket: stopping leaves it.
+    server->stop();
+    struct stat st;
+    EXPECT_EQ(::lstat(path_.c_str(), &st), 0);
+}
+
 TEST_F(IpcServerTest, KnowsWhoIsCalling) {
     std::mutex mutex;
     std::shared_ptr<IpcPeer> welcomed;

@@ -2,6 +2,7 @@
 // operations. One per message (or per piece of the daemon's own work).
 #pragma once
 
+#include <functional>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -11,16 +12,24 @@
 #include <vector>
 
 #include "Daemon/Concurrency/VSLCommandQueue.h"
+#include "Daemon/Core/VSLContainerIdentity.h"
+#include "Daemon/Core/VSLError.h"
 #include "Daemon/Service/VSLClientIdentity.h"
 #include "Platform/WorkQueue.h"
 
 namespace vsl {
 
 class VSLUserIdentityCache;
+class VSLMetadata;
+using VSLMetadataRef = std::shared_ptr<VSLMetadata>;
+class VSLReply;
+
+// "com.tarrow.vesseld.deathrow": serial, background priority.
+const std::shared_ptr<WorkQueue>& deathRowQueue();
 class VSLClientConnection;
 using VSLClientConnectionRef = std::shared_ptr<VSLClientConnection>;
 
-class VSLClientConnection {
+class VSLClientConnection : public std::enable_shared_from_this<VSLClientConnection> {
 public:
     static VSLClientConnectionRef create(VSLClientIdentityRef clientIdentity, bool entitled, bool allowOtherIdLookup,
                                          bool unrestricted, std::optional<Value> lookup,
@@ -56,8 +65,33 @@ public:
     // Runs the queued commands until the queue is empty or one fails.
     bool completeWithError(uint64_t* code);
 
+    // Containers. Create-or-lookup takes the global read lock to look up and the write
+    // lock to create, unless `useLocking` is false (the caller holds the write lock).
+    VSLMetadataRef createOrLookupContainerWithContainerIdentity(const VSLContainerIdentityRef& identity,
+                                                                bool createIfNecessary, bool transient,
+                                                                bool useLocking, uint64_t* code);
+    std::optional<std::vector<VSLMetadataRef>> containersWithClass(VSLContainerClass containerClass, bool transient,
+                                                                   uint64_t* code);
+    // Queues the deletion on this request's command queue.
+    bool deleteContainerWithContainerIdentity(const VSLContainerIdentityRef& identity, bool transient,
+                                              uint64_t* code);
+    bool _createTopLevelContainerDirectory(const std::string& url, VSLContainerClass containerClass, uid_t owner,
+                                           VSLErrorRef* error);
+    bool _createSubDirectories(const std::string& url, const VSLMetadata& metadata, VSLErrorRef* error);
+    int32_t _dataProtectionClassForContainerMetadata(const VSLMetadata& metadata);
+
+    // Death row. Destruction runs later on the death-row queue inside a keep-alive
+    // transaction; the completion gets 1, or the code of the last failure.
+    void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
+    // True when the item is on death row or no longer exists.
+    bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread, VSLErrorRef* error);
+    // True when the item is gone from its place (removed, or moved to /tmp).
+    bool _removeItemOrMoveToTempAtURL(const std::string& url, VSLErrorRef* error);
+
 private:
     VSLClientConnection() = default;
+    bool mayAccess(const VSLContainerIdentity& identity, uint64_t* code);
+    VSLMetadataRef createContainer(const VSLContainerIdentityRef& identity, bool transient, VSLErrorRef* error);
 
     VSLClientIdentityRef clientIdentity_;
     std::shared_ptr<VSLCommandQueue> commandQueue_;
@@ -71,5 +105,9 @@ private:
     std::mutex mutex_;  // creates the sanitized lookup
     std::shared_ptr<std::pair<std::mutex, std::map<std::string, std::set<std::string>>>> sanitizedLookup_;
 };
+
+// Adds a sandbox token for the container to the reply when the rules allow one.
+void issueSandboxExtension(VSLReply& reply, const char* replyKey, const VSLMetadata& metadata,
+                           const VSLClientIdentityRef& client);
 
 }  // namespace vsl

@@ -1,7 +1,9 @@
 #include "Daemon/Service/VSLCommandTable.h"
 
 #include "Client/VSLProtocol.h"
+#include "Daemon/CodeSigning/VSLCodeSigningHandlers.h"
 #include "Daemon/Core/VSLErrorCodes.h"
+#include "Daemon/Service/VSLContainerHandlers.h"
 #include "Daemon/Service/VSLEntitlements.h"
 #include "Daemon/Service/VSLRequestDecoding.h"
 #include "Platform/Log.h"
@@ -17,8 +19,8 @@ void retiredCommand(const Value&, const VSLReplyRef&, const VSLClientConnectionR
 constexpr const char* A = kVSLEntitlementAllowed;
 
 const VSLCommandRow kCommands[kVSLCommandCount] = {
-    {0, nullptr, A, 0x10101},
-    {1, nullptr, A, 0x10001},
+    {0, handleCreateOrLookup, A, 0x10101},
+    {1, handleContainersWithClass, A, 0x10001},
     {2, nullptr, A, 0x1},
     {3, nullptr, A, 0x1},
     {4, nullptr, kVSLEntitlementUserManagedAssets, 0x0},
@@ -27,7 +29,7 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {7, nullptr, A, 0x1},
     {8, nullptr, A, 0x1},
     {9, nullptr, A, 0x1},
-    {10, nullptr, A, 0x1},
+    {10, handleDeleteContainer, A, 0x1},
     {11, nullptr, kVSLEntitlementWipeContainer, 0x1},
     {12, nullptr, kVSLEntitlementDeleteContainerContent, 0x1},
     {13, nullptr, A, 0x10101},
@@ -35,9 +37,9 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {15, nullptr, A, 0x10101},
     {16, nullptr, A, 0x10101},
     {17, nullptr, A, 0x10101},
-    {18, nullptr, A, 0x1},
-    {19, nullptr, A, 0x1},
-    {20, nullptr, A, 0x1},
+    {18, processCodeSigningInfoCommand, A, 0x1},
+    {19, getCodeSigningInfoCommand, A, 0x1},
+    {20, invalidateCodeSigningInfoCommand, A, 0x1},
     {21, nullptr, A, 0x0},
     {22, nullptr, A, 0x1},
     {23, nullptr, A, 0x10001},

@@ -53,8 +53,10 @@ VSLClientConnectionRef checkEntitlementsAndInitClientObject(const VSLPeerCredent
     }
 
     if (entitled || (row.flags & kVSLCommandFlagAllowUnentitled) || lookup) {
-        uint64_t rc = VSLCodeSigningMapping::sharedInstance()->processCallerRegisteredEntitlements(
-            identity->entitlements(), identity->bundleIdentifier(), commandQueue);
+        auto mapping = VSLCodeSigningMapping::sharedInstance();
+        uint64_t rc = mapping ? mapping->processCallerRegisteredEntitlements(identity->entitlements(),
+                                                                             identity->bundleIdentifier(), commandQueue)
+                              : uint64_t(kVSLErrorDatabase);
         if (rc != kVSLSuccess)
             LogWrite(kLogLevelError, kRightsFn, "Error processing entitlements for %@ : %llu",
                      identity->bundleIdentifier(), rc);

@@ -80,7 +80,8 @@ VSLUserIdentityRef userIdentityForContainerIdentifier(VSLClientConnection& conne
 
     std::string bundleIdentifier = identifier;
     if (isChildDataContainerClass(containerClass)) {
-        if (auto parent = VSLCodeSigningMapping::sharedInstance()->parentIdentifierForChildIdentifier(identifier))
+        auto mapping = VSLCodeSigningMapping::sharedInstance();
+        if (auto parent = mapping ? mapping->parentIdentifierForChildIdentifier(identifier) : std::nullopt)
             bundleIdentifier = *parent;
     }
     auto cache = VSLUserIdentitySharedCache::sharedInstance();

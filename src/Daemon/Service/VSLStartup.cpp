@@ -13,11 +13,6 @@
 
 namespace vsl {
 
-const std::shared_ptr<WorkQueue>& deathRowQueue() {
-    static const auto queue = WorkQueue::serial("com.tarrow.vesseld.deathrow", QueuePriority::Background);
-    return queue;
-}
-
 const std::shared_ptr<WorkQueue>& lockStateQueue() {
     static const auto queue = WorkQueue::serial("com.tarrow.vesseld.lockstate");
     return queue;

@@ -11,7 +11,6 @@ namespace vsl {
 // `transaction` is the keep-alive that main opened; closed when start-up is done.
 void vesseld_init(std::shared_ptr<Transaction> transaction);
 
-const std::shared_ptr<WorkQueue>& deathRowQueue();
 const std::shared_ptr<WorkQueue>& lockStateQueue();
 
 }  // namespace vsl

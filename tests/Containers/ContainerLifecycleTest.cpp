@@ -1,0 +1,185 @@
+// End to end: clients create, find, list and delete containers through a real
+// daemon, and the result is checked on disk.
+#include <gtest/gtest.h>
+#include <dirent.h>
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstdlib>
+#include <fstream>
+#include <set>
+#include <thread>
+
+#include "Platform/FileFlags.h"
+#include "Support/DaemonProcess.h"
+#include "Support/TempRoot.h"
+
+using namespace vsl;
+using namespace vsl::test;
+
+namespace {
+
+uint64_t code(const DaemonProcess::CtlResult& r) {
+    const Value* c = r.reply.find("ReplyError");
+    return c && c->uint64Value() ? *c->uint64Value() : 0;
+}
+
+std::string str(const DaemonProcess::CtlResult& r, const char* key) {
+    const Value* v = r.reply.find(key);
+    return v && v->stringValue() ? *v->stringValue() : std::string();
+}
+
+// UUIDs come back from the property-list output as their 16 bytes.
+std::string uuid(const DaemonProcess::CtlResult& r) {
+    const Value* v = r.reply.find("ReplyUUID");
+    if (!v || !v->dataValue()) return {};
+    auto u = Uuid::fromBytes(v->dataValue()->data(), v->dataValue()->size());
+    return u ? u->string() : std::string();
+}
+
+bool existed(const DaemonProcess::CtlResult& r) {
+    const Value* v = r.reply.find("ReplyExisted");
+    return v && v->boolValue().value_or(false);
+}
+
+class Containers : public ::testing::Test {
+protected:
+    void SetUp() override {
+        app = daemon.addClient("app", "com.example.app", Value::dictionary({}));
+        admin = daemon.addClient("admin", "com.example.admin",
+                                 dict({{"com.tarrow.private.Vesselry.allowed", Value::boolean(true)}}));
+        ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
+    }
+    DaemonProcess daemon;
+    std::string app, admin;
+};
+
+}  // namespace
+
+TEST_F(Containers, OwnDataContainerIsMadeOnceAndFoundAgain) {
+    auto made = daemon.run(app, {"createOrLookup", "ContainerClass=2", "CreateIfNecessary=true"});
+    ASSERT_EQ(1u, code(made)) << made.err;
+    EXPECT_FALSE(existed(made));
+    EXPECT_EQ("com.example.app", str(made, "ReplyIdentifier")) << "no Identifier: the client's own";
+    std::string path = str(made, "ReplyPath");
+    EXPECT_EQ(0u, path.find(daemon.at("private/var/mobile/Containers/Data/Application/")));
+    EXPECT_FALSE(made.reply.find("ReplySandboxToken")) << "not sandboxed: no token";
+
+    struct stat st;
+    ASSERT_EQ(0, ::stat(path.c_str(), &st));
+    EXPECT_EQ(0755u, st.st_mode & 07777);
+    for (const char* sub : {"Documents", "Library", "Library/Caches", "Library/Preferences", "tmp", "SystemData"}) {
+        ASSERT_EQ(0, ::stat((path + "/" + sub).c_str(), &st)) << sub;
+        EXPECT_TRUE(S_ISDIR(st.st_mode)) << sub;
+        EXPECT_EQ(0755u, st.st_mode & 07777) << sub;
+        if (::geteuid() == 0) {
+            EXPECT_EQ(501u, st.st_uid) << sub << ": owned by the mobile user";
+        }
+    }
+    EXPECT_EQ(0, ::access((path + "/.com.tarrow.vesselry.metadata.plist").c_str(), F_OK));
+
+    auto again = daemon.run(app, {"createOrLookup", "ContainerClass=2"});
+    ASSERT_EQ(1u, code(again));
+    EXPECT_TRUE(existed(again));
+    EXPECT_EQ(uuid(made), uuid(again));
+    EXPECT_EQ(path, str(again, "ReplyPath"));
+
+    // The daemon forgets nothing across a restart.
+    ASSERT_EQ(0, daemon.stop());
+    ASSERT_TRUE(daemon.start());
+    auto afterRestart = daemon.run(app, {"createOrLookup", "ContainerClass=2"});
+    ASSERT_EQ(1u, code(afterRestart));
+    EXPECT_TRUE(existed(afterRestart));
+    EXPECT_EQ(uuid(made), uuid(afterRestart));
+}
+
+TEST_F(Containers, AbsentOrForeignContainersAreRefused) {
+    EXPECT_EQ(21u, code(daemon.run(app, {"createOrLookup", "ContainerClass=4"}))) << "create false, absent";
+    EXPECT_EQ(55u, code(daemon.run(app, {"createOrLookup", "Identifier=com.example.other", "ContainerClass=2",
+                                         "CreateIfNecessary=true"})))
+        << "another identifier without rights";
+    EXPECT_EQ(20u, code(daemon.run(app, {"createOrLookup", "ContainerClass=0"})));
+    EXPECT_EQ(20u, code(daemon.run(app, {"createOrLookup", "ContainerClass=14"})));
+    EXPECT_EQ(18u, code(daemon.run(admin, {"deleteContainer", "ContainerClass=2"}))) << "delete needs an Identifier";
+    EXPECT_EQ(21u, code(daemon.run(admin, {"deleteContainer", "Identifier=com.example.none", "ContainerClass=2"})));
+}
+
+TEST_F(Containers, ConcurrentCreatorsGetOneContainer) {
+    std::vector<DaemonProcess::CtlResult> results(8);
+    std::vector<std::thread> threads;
+    for (auto& r : results)
+        threads.emplace_back([&] {
+            r = daemon.run(admin, {"createOrLookup", "Identifier=com.example.shared", "ContainerClass=2",
+                                   "CreateIfNecessary=true"});
+        });
+    for (auto& t : threads) t.join();
+    std::set<std::string> uuids;
+    int created = 0;
+    for (auto& r : results) {
+        ASSERT_EQ(1u, code(r)) << r.err;
+        uuids.insert(uuid(r));
+        created += existed(r) ? 0 : 1;
+    }
+    EXPECT_EQ(1u, uuids.size());
+    EXPECT_EQ(1, created) << "exactly one caller made it";
+    auto listed = daemon.run(admin, {"containersWithClass", "ContainerClass=2"});
+    ASSERT_EQ(1u, code(listed));
+    size_t shared = 0;
+    for (const auto& id : *listed.reply.find("ReplyIdsArray")->arrayValue())
+        shared += *id.stringValue() == "com.example.shared";
+    EXPECT_EQ(1u, shared);
+}
+
+TEST_F(Containers, TransientRecreateAndDelete) {
+    auto first = daemon.run(admin, {"createOrLookup", "Identifier=com.example.t", "ContainerClass=2", "Transient=true",
+                                    "CreateIfNecessary=true"});
+    ASSERT_EQ(1u, code(first)) << first.err;
+    auto second = daemon.run(admin, {"createOrLookup", "Identifier=com.example.t", "ContainerClass=2",
+                                     "Transient=true", "CreateIfNecessary=true"});
+    ASSERT_EQ(1u, code(second));
+    EXPECT_NE(uuid(first), uuid(second)) << "a transient request never returns the old transient container";
+    EXPECT_NE(0, ::access(str(first, "ReplyPath").c_str(), F_OK)) << "the old one left its place for death row";
+
+    auto made = daemon.run(admin, {"createOrLookup", "Identifier=com.example.d", "ContainerClass=2",
+                                   "CreateIfNecessary=true"});
+    ASSERT_EQ(1u, code(made));
+    EXPECT_EQ(1u, code(daemon.run(admin, {"deleteContainer", "Identifier=com.example.d", "ContainerClass=2"})));
+    EXPECT_NE(0, ::access(str(made, "ReplyPath").c_str(), F_OK)) << "gone from its class directory at the reply";
+    EXPECT_EQ(21u, code(daemon.run(admin, {"createOrLookup", "Identifier=com.example.d", "ContainerClass=2"})));
+}
+
+TEST_F(Containers, FailureAfterStagingLeavesNothingBehind) {
+    // An immutable class directory: lookups still read it, the final move into it fails.
+    auto made = daemon.run(admin, {"createOrLookup", "Identifier=com.example.first", "ContainerClass=4",
+                                   "CreateIfNecessary=true"});
+    ASSERT_EQ(1u, code(made));
+    std::string classDir = daemon.at("private/var/mobile/Containers/Data/PluginKitPlugin");
+    int fd = ::open(classDir.c_str(), O_RDONLY | O_DIRECTORY);
+    ASSERT_GE(fd, 0);
+    unsigned flags = 0;
+    if (getFileFlags(fd, &flags) != 0 || setFileFlags(fd, classDir, flags | FS_IMMUTABLE_FL) != 0) {
+        ::close(fd);
+        GTEST_SKIP() << "needs root and a file system with the immutable flag";
+    }
+    auto r = daemon.run(admin, {"createOrLookup", "Identifier=com.example.p", "ContainerClass=4",
+                                "CreateIfNecessary=true"});
+    setFileFlags(fd, classDir, flags);
+    ::close(fd);
+    EXPECT_EQ(8u, code(r)) << r.err;
+
+    size_t inClass = 0;
+    if (auto d = opendir(classDir.c_str())) {
+        while (auto e = readdir(d)) inClass += e->d_name[0] != '.';
+        closedir(d);
+    }
+    EXPECT_EQ(1u, inClass) << "only the container made before";
+    std::string staging = daemon.at("private/var/mobile/Containers/Staging");
+    size_t left = 0;
+    if (auto d = opendir(staging.c_str())) {
+        while (auto e = readdir(d)) left += e->d_name[0] != '.';
+        closedir(d);
+    }
+    EXPECT_EQ(0u, left) << "the staging directory went to death row";
+}
