@@ -183,3 +183,26 @@ TEST_F(Containers, FailureAfterStagingLeavesNothingBehind) {
     }
     EXPECT_EQ(0u, left) << "the staging directory went to death row";
 }
+
+TEST(DeathRow, LeftoversGoAtStartAndOnRequest) {
+    DaemonProcess daemon;
+    std::string dead = daemon.at("private/var/root/Library/Caches/com.tarrow.vesseld/Dead");
+    ASSERT_EQ(0, std::system(("mkdir -p '" + dead + "/LEFT-BY-A-CRASH/deep/er'").c_str()));
+    std::ofstream(dead + "/LEFT-BY-A-CRASH/deep/file") << "x";
+    std::string cleaner = daemon.addClient("cleaner", "com.example.cleaner",
+                                           dict({{"com.tarrow.private.Vesselry.userManagedAssets", Value::boolean(true)}}));
+    ASSERT_TRUE(daemon.start());
+    bool gone = false;
+    for (int i = 0; i < 400 && !gone; i++) {
+        gone = ::access((dead + "/LEFT-BY-A-CRASH").c_str(), F_OK) != 0;
+        if (!gone) std::this_thread::sleep_for(std::chrono::milliseconds(25));
+    }
+    EXPECT_TRUE(gone) << "items a crash left on death row are destroyed after the next start";
+
+    ASSERT_EQ(0, std::system(("mkdir -p '" + dead + "/LATER'").c_str()));
+    auto r = daemon.run(cleaner, {"deleteContainersOnDeathRow"});
+    EXPECT_EQ(1u, code(r)) << r.err;
+    EXPECT_EQ(1u, r.reply.dictionaryValue()->size()) << "only ReplyError, sent from the completion";
+    EXPECT_NE(0, ::access((dead + "/LATER").c_str(), F_OK)) << "the reply comes after the destruction";
+    EXPECT_EQ(0, ::access(dead.c_str(), F_OK)) << "death row itself stays";
+}

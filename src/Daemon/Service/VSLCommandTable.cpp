@@ -23,7 +23,7 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {1, handleContainersWithClass, A, 0x10001},
     {2, nullptr, A, 0x1},
     {3, nullptr, A, 0x1},
-    {4, nullptr, kVSLEntitlementUserManagedAssets, 0x0},
+    {4, handleDeleteContainersOnDeathRow, kVSLEntitlementUserManagedAssets, 0x0},
     {5, nullptr, A, 0x1},
     {6, nullptr, A, 0x1},
     {7, nullptr, A, 0x1},

@@ -49,3 +49,12 @@ void handleDeleteContainer(const Value& request, const VSLReplyRef&, const VSLCl
 }
 
 }  // namespace vsl
+
+namespace vsl {
+
+void handleDeleteContainersOnDeathRow(const Value&, const VSLReplyRef& reply, const VSLClientConnectionRef& connection,
+                                      uint64_t*) {
+    connection->deleteContainersOnDeathRowWithCompletion([reply](uint64_t result) { reply->sendWithCode(result); });
+}
+
+}  // namespace vsl

@@ -14,3 +14,9 @@ void handleDeleteContainer(const Value& request, const VSLReplyRef& reply, const
                            uint64_t* code);
 
 }  // namespace vsl
+
+namespace vsl {
+// deleteContainersOnDeathRow (4): answers from the completion, after destruction.
+void handleDeleteContainersOnDeathRow(const Value& request, const VSLReplyRef& reply,
+                                      const VSLClientConnectionRef& connection, uint64_t* code);
+}  // namespace vsl

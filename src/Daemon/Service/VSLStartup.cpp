@@ -39,7 +39,8 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     }
     if (validateCommandTable() != 0)
         LogWrite(kLogLevelError, "vesseld_init", "The command table is inconsistent; affected commands answer 49");
-    VSLClientConnection::sharedClientConnection();
+    // Every start: whatever a crash left on death row is destroyed in the background.
+    VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);
 
     interval.end("");
     transaction->close();

@@ -95,7 +95,6 @@ bool VSLContainerCache::_lock_getCache(ClassIndex& index, const std::string& key
                                        VSLErrorRef* error) {
     if (index.built) return true;
     if (!buildCache) return false;
-    static std::mutex big; std::lock_guard<std::mutex> bigLock(big);
     osLog(LogCategory::Cache, OSLogLevel::Default, "Rebuilding container class cache: %@%@", key,
           transientMarker(transient));
     SignpostInterval signpost(LogCategory::Cache, "RebuildingCache",
@@ -159,7 +158,7 @@ VSLMetadataRef VSLContainerCache::containerForContainerIdentity(const VSLContain
         VSLMetadataRef record;
         {
             std::lock_guard<std::mutex> lock(index->mutex);
-            if (false && !index->built && allowKernelLookup && !transient)
+            if (!index->built && allowKernelLookup && !transient)
                 record = _lock_metadataFromSandboxForContainerIdentity(*identity);
             if (!record) {
                 VSLErrorRef buildError;
