@@ -137,9 +137,14 @@ TEST_F(CodeSigningTest, GroupsAreStagedOnlyForUsersWithAHome) {
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(appGroups(strings({"group.y"})), "A", std::nullopt, queue));
     EXPECT_EQ(1u, queue->pendingCount()) << "the personal user only: the enterprise home does not exist";
     EXPECT_TRUE(drain(queue)) << "a container not found does not fail the drain";
-    auto failures = log_.count("Failed to destroy group container with identifier group.x for ");
-    EXPECT_EQ(1u, failures);
-    EXPECT_EQ(1u, log_.count("personaUniqueString = P-1>: 21"));
+    size_t personal = 0, all = 0;
+    for (const auto& m : log_.messages()) {
+        if (m.find("Failed to destroy group container with identifier group.x for ") == std::string::npos) continue;
+        all++;
+        if (m.find("personaUniqueString = P-1,") != std::string::npos) personal++;
+    }
+    EXPECT_EQ(1u, all) << "nothing is on disk, so the one staging reports its lookup failure";
+    EXPECT_EQ(1u, personal);
 
     codeSigningTestRoot().writeFile("private/var/enterprise/E-1/.keep", "");
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(std::nullopt, "A", std::nullopt, queue));
@@ -244,8 +249,6 @@ TEST_F(CodeSigningTest, EntriesWithoutABundleContainerAreInvalidatedAndCachedInf
     makeContainer(user, kVSLClassApplication, "installed");
     reg("plugin.installed");
     makeContainer(user, kVSLClassPlugin, "plugin.installed");
-    reg("gone.ext", dict({{kVSLOptionDataContainerClass, Value::uint64(4)}}));
-    reg("gone", Value());
     reg("gone.ext", dict({{kVSLOptionDataContainerClass, Value::uint64(4)}, {kVSLOptionParentBundleID, Value::string("gone")}}));
     reg("orphan.ext", dict({{kVSLOptionDataContainerClass, Value::uint64(4)}}));
     ASSERT_EQ(kVSLSuccess, mapping_->processCallerRegisteredEntitlements(dict({}), "self.registered", queue));

@@ -61,9 +61,9 @@ bool VSLCommandStageForDelete::stageAll(const std::shared_ptr<VSLCommandQueue>& 
         if (!identity) continue;
         VSLMetadataRef container;
         if (identity->isConcrete()) {
+            // This lookup reports no error of its own.
             container = cache->containerForContainerIdentity(
                 std::static_pointer_cast<const VSLConcreteContainerIdentity>(identity));
-            if (!container) *pending = nullptr;
         } else {
             VSLErrorRef lookupError;
             container = cache->containerForContainerIdentity(identity, false, true, &lookupError);

@@ -2,7 +2,6 @@
 
 #include <mutex>
 
-#include "Platform/AuditToken.h"
 #include "Platform/CodeSigningPolicy.h"
 
 namespace vsl {
@@ -12,16 +11,14 @@ namespace {
 class PolicyStoreService : public VSLCodeSigningService {
 public:
     VSLCodeSigningFacts factsForPeer(const VSLPeerCredentials& peer) override {
-        auto& policy = CodeSigningPolicy::shared();
-        CodeSigningInfo info;
-        if (!peer.executablePath.empty()) {
-            info = policy.infoForExecutable(peer.executablePath);
-        } else {
-            AuditToken token;
-            token.words = peer.auditToken;
-            info = policy.infoForAuditToken(token);
-        }
         VSLCodeSigningFacts facts;
+        // Only the executable seen at connect counts: reading it now would let a
+        // process that exec'd since lend the new image's rights to the old connection.
+        if (peer.executablePath.empty()) {
+            facts.error = "executable of the peer unknown";
+            return facts;
+        }
+        CodeSigningInfo info = CodeSigningPolicy::shared().infoForExecutable(peer.executablePath);
         facts.signingIdentifier = info.signingIdentifier;
         facts.entitlements = Value::dictionary(std::move(info.entitlements));
         facts.sandboxed = info.sandboxed;

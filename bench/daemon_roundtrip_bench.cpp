@@ -1,0 +1,252 @@
+// Whole-daemon costs against the machine's floors, measured in one run:
+//  - command 32 and the lookup of an existing container (command 0) over IPC, vs a
+//    bare blocking echo of the same frame sizes over the same kind of socket;
+//  - the creation of a new data container (command 0) vs the bare system-call
+//    sequence it needs (mkdir of the skeleton, metadata written to a temporary file,
+//    fsync, rename, directory fsync);
+//  - lookups per second with 4 concurrent clients.
+// Starts a real vesseld (next to this program's build tree) on a scratch root and
+// registers this program in its policy store.
+//
+//   daemon_roundtrip_bench [round trips, default 5000]
+#include <fcntl.h>
+#include <limits.h>
+#include <signal.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <cstring>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "Client/VSLConnection.h"
+#include "Daemon/Core/VSLPropertyListFile.h"
+#include "Platform/IpcWire.h"
+
+using namespace vsl;
+using Clock = std::chrono::steady_clock;
+
+namespace {
+
+double usSince(Clock::time_point t) { return std::chrono::duration<double, std::micro>(Clock::now() - t).count(); }
+
+double median(std::vector<double> v) {
+    std::sort(v.begin(), v.end());
+    return v.empty() ? 0 : v[v.size() / 2];
+}
+
+std::string selfPath() {
+    char buf[PATH_MAX];
+    ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
+    buf[n > 0 ? n : 0] = 0;
+    return buf;
+}
+
+bool readAll(int fd, void* p, size_t n) {
+    auto* c = static_cast<char*>(p);
+    while (n) {
+        ssize_t r = read(fd, c, n);
+        if (r <= 0) return false;
+        c += r;
+        n -= static_cast<size_t>(r);
+    }
+    return true;
+}
+
+// The floor: read a length-prefixed frame, write a canned reply frame, one thread.
+double bareEchoMicros(const std::string& dir, size_t requestBytes, size_t replyBytes, int n) {
+    std::string path = dir + "/echo.sock";
+    int listener = socket(AF_UNIX, SOCK_STREAM, 0);
+    sockaddr_un addr{};
+    addr.sun_family = AF_UNIX;
+    std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
+    bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    listen(listener, 4);
+    std::thread server([&] {
+        int fd = accept(listener, nullptr, nullptr);
+        std::string reply(replyBytes, 'r');
+        std::vector<char> buf(1 << 16);
+        for (;;) {
+            uint32_t len;
+            if (!readAll(fd, &len, 4) || !readAll(fd, buf.data(), len)) break;
+            uint32_t out = static_cast<uint32_t>(reply.size());
+            std::string frame(reinterpret_cast<char*>(&out), 4);
+            frame += reply;
+            if (write(fd, frame.data(), frame.size()) != static_cast<ssize_t>(frame.size())) break;
+        }
+        close(fd);
+    });
+    int c = socket(AF_UNIX, SOCK_STREAM, 0);
+    connect(c, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
+    std::string request(requestBytes, 'q');
+    uint32_t len = static_cast<uint32_t>(request.size());
+    std::string frame(reinterpret_cast<char*>(&len), 4);
+    frame += request;
+    std::vector<char> buf(1 << 16);
+    std::vector<double> samples;
+    for (int i = 0; i < n; i++) {
+        auto t = Clock::now();
+        if (write(c, frame.data(), frame.size()) < 0) break;
+        uint32_t rl;
+        readAll(c, &rl, 4);
+        readAll(c, buf.data(), rl);
+        samples.push_back(usSince(t));
+    }
+    close(c);
+    server.join();
+    close(listener);
+    unlink(path.c_str());
+    return median(samples);
+}
+
+// The floor of a creation: what a container needs from the kernel, done by hand.
+double bareCreateMicros(const std::string& dir, int n) {
+    std::vector<double> samples;
+    std::string live = dir + "/live";
+    mkdir(live.c_str(), 0755);
+    std::string metadata(600, 'm');
+    for (int i = 0; i < n; i++) {
+        auto t = Clock::now();
+        std::string staging = dir + "/stage-" + std::to_string(i);
+        mkdir(staging.c_str(), 0755);
+        for (const char* sub : {"Documents", "Library", "Library/Caches", "Library/Preferences", "SystemData", "tmp"})
+            mkdir((staging + "/" + sub).c_str(), 0755);
+        std::string tmp = staging + "/.tmp-metadata";
+        int fd = open(tmp.c_str(), O_WRONLY | O_CREAT | O_TRUNC, 0644);
+        if (write(fd, metadata.data(), metadata.size()) < 0) break;
+        fsync(fd);
+        close(fd);
+        rename(tmp.c_str(), (staging + "/.metadata.plist").c_str());
+        int d = open(staging.c_str(), O_RDONLY | O_DIRECTORY);
+        fsync(d);
+        close(d);
+        rename(staging.c_str(), (live + "/" + std::to_string(i)).c_str());
+        d = open(live.c_str(), O_RDONLY | O_DIRECTORY);
+        fsync(d);
+        close(d);
+        samples.push_back(usSince(t));
+    }
+    return median(samples);
+}
+
+}  // namespace
+
+int main(int argc, char** argv) {
+    int n = argc > 1 ? std::atoi(argv[1]) : 5000;
+    char templ[] = "/tmp/vessel-bench-XXXXXX";
+    std::string root = mkdtemp(templ);
+    std::string daemonPath = selfPath();
+    daemonPath = daemonPath.substr(0, daemonPath.rfind('/')) + "/../src/vesseld";
+
+    std::string policyDir = root + "/etc/vesseld/code-signatures";
+    std::system(("mkdir -p '" + policyDir + "'").c_str());
+    VSLErrorRef error;
+    VSL_writeToURL(dict({{"Executable", Value::string(selfPath())},
+                         {"SigningIdentifier", Value::string("com.example.bench")},
+                         {"Entitlements", dict({{"com.tarrow.private.Vesselry.allowed", Value::boolean(true)}})}}),
+                   policyDir + "/bench.plist", kVSLWriteAtomic, &error);
+    chmod((policyDir + "/bench.plist").c_str(), 0644);
+
+    pid_t pid = fork();
+    if (pid == 0) {
+        setenv("VESSELD_OSLOG", "off", 1);
+        int devnull = open("/dev/null", O_WRONLY);
+        dup2(devnull, 2);
+        execl(daemonPath.c_str(), daemonPath.c_str(), "--root", root.c_str(), "--init", nullptr);
+        _exit(127);
+    }
+    std::string socketPath = client::VSLConnection::socketPathForSystemRoot(root);
+    std::shared_ptr<client::VSLConnection> c;
+    for (int i = 0; i < 400 && !c; i++) {
+        c = client::VSLConnection::connect(socketPath, nullptr);
+        if (!c) std::this_thread::sleep_for(std::chrono::milliseconds(25));
+    }
+    if (!c) {
+        std::fprintf(stderr, "daemon did not start (%s)\n", daemonPath.c_str());
+        return 1;
+    }
+    auto call = [&](const std::shared_ptr<client::VSLConnection>& conn, const Value& req) {
+        auto r = conn->sendRequest(req, std::chrono::seconds(30));
+        return r.ok() && r.body.find("ReplyError")->uint64Value() == 1u;
+    };
+
+    Value personas = dict({{"Command", Value::uint64(32)}});
+    Value create = dict({{"Command", Value::uint64(0)},
+                         {"Identifier", Value::string("com.example.bench.app")},
+                         {"ContainerClass", Value::uint64(2)},
+                         {"CreateIfNecessary", Value::boolean(true)}});
+    for (int i = 0; i < 200; i++) call(c, personas);  // warm up
+    if (!call(c, create)) {
+        std::fprintf(stderr, "create failed\n");
+        return 1;
+    }
+
+    std::vector<double> s32, sLookup;
+    for (int i = 0; i < n; i++) {
+        auto t = Clock::now();
+        call(c, personas);
+        s32.push_back(usSince(t));
+    }
+    Value lookup = dict({{"Command", Value::uint64(0)},
+                         {"Identifier", Value::string("com.example.bench.app")},
+                         {"ContainerClass", Value::uint64(2)}});
+    for (int i = 0; i < n; i++) {
+        auto t = Clock::now();
+        call(c, lookup);
+        sLookup.push_back(usSince(t));
+    }
+    size_t req = encodeFrame(1, 0, lookup)->size();
+    size_t rep = 300;
+    double echo = bareEchoMicros(root, req, rep, n);
+
+    int creations = std::max(50, n / 50);
+    std::vector<double> sCreate;
+    for (int i = 0; i < creations; i++) {
+        Value fresh = dict({{"Command", Value::uint64(0)},
+                            {"Identifier", Value::string("com.example.bench.new" + std::to_string(i))},
+                            {"ContainerClass", Value::uint64(2)},
+                            {"CreateIfNecessary", Value::boolean(true)}});
+        auto t = Clock::now();
+        call(c, fresh);
+        sCreate.push_back(usSince(t));
+    }
+    std::string bareDir = root + "/bare";
+    mkdir(bareDir.c_str(), 0755);
+    double bareCreate = bareCreateMicros(bareDir, creations);
+
+    const int clients = 4;
+    std::vector<std::thread> threads;
+    std::vector<int> done(clients, 0);
+    auto t0 = Clock::now();
+    for (int k = 0; k < clients; k++)
+        threads.emplace_back([&, k] {
+            auto conn = client::VSLConnection::connect(socketPath, nullptr);
+            for (int i = 0; i < n / 2; i++) done[k] += call(conn, lookup) ? 1 : 0;
+        });
+    for (auto& t : threads) t.join();
+    double seconds = usSince(t0) / 1e6;
+    int total = 0;
+    for (int d : done) total += d;
+
+    std::printf("command 32 round trip      %8.1f us   ratio to bare echo %5.2f\n", median(s32), median(s32) / echo);
+    std::printf("lookup (existing) over IPC %8.1f us   ratio to bare echo %5.2f  (target <= 2)\n", median(sLookup),
+                median(sLookup) / echo);
+    std::printf("bare echo (floor)          %8.1f us\n", echo);
+    std::printf("create data container      %8.1f us   ratio to bare syscalls %5.2f  (target <= 2)\n",
+                median(sCreate), median(sCreate) / bareCreate);
+    std::printf("bare create (floor)        %8.1f us\n", bareCreate);
+    std::printf("lookups/s, %d clients       %8.0f\n", clients, total / seconds);
+
+    kill(pid, SIGTERM);
+    waitpid(pid, nullptr, 0);
+    std::system(("rm -rf '" + root + "'").c_str());
+    return 0;
+}
