@@ -13,7 +13,7 @@ int main() {
 
     const vsl::VSLFileManager& fm = vsl::VSLFileManager::defaultManager();
     std::vector<double> ours, cp;
-    for (int round = 0; round < 3; round++) {
+    for (int round = 0; round < 2; round++) {
         for (int turn = 0; turn < 2; turn++) {
             std::string copy = scratch + "/copy" + std::to_string(round) + "-" + std::to_string(turn);
             ::sync();

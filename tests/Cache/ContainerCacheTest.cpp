@@ -340,6 +340,58 @@ TEST_F(ContainerCache, InvalidClassesAreRefusedAndInvalidationStartsOver) {
     EXPECT_EQ(2, scansOf(kAppData));
 }
 
+TEST_F(ContainerCache, ConcurrentChangesAndInvalidationsLoseNoContainer) {
+    constexpr int kWorkers = 3, kSteps = 40;
+    std::vector<std::set<std::string>> live(kWorkers);
+    std::atomic<bool> done{false};
+    std::vector<std::future<void>> workers;
+    for (int w = 0; w < kWorkers; w++) {
+        workers.push_back(std::async(std::launch::async, [&, w] {
+            std::map<std::string, VSLMetadataRef> mine;
+            for (int step = 0; step < kSteps; step++) {
+                std::string identifier = "com.w" + std::to_string(w) + "." + std::to_string(step % 7);
+                VSLContainerClass c = step % 3 == 0 ? 7 : 2;
+                std::string key = identifier + "/" + std::to_string(c);
+                VSLErrorRef error;
+                if (auto it = mine.find(key); it != mine.end()) {
+                    EXPECT_TRUE(lookup(*cache, mobile, c, identifier, &error)) << key;
+                    removeTree(it->second->url());
+                    EXPECT_TRUE(cache->removeContainerForUserIdentity(mobile, c, identifier, false, &error)) << key;
+                    mine.erase(it);
+                } else {
+                    auto m = makeContainer(mobile, c, identifier);
+                    EXPECT_TRUE(cache->addContainerMetadata(m, m->url(), false, true, &error)) << key;
+                    mine[key] = m;
+                }
+            }
+            for (const auto& [key, m] : mine) live[w].insert(m->url());
+        }));
+    }
+    auto churn = std::async(std::launch::async, [&] {
+        while (!done) {
+            cache->invalidateUserIdentity(mobile);
+            VSLErrorRef error;
+            EXPECT_TRUE(cache->allContainersForUserIdentity(mobile, 2, false, &error));
+        }
+    });
+    for (auto& f : workers) ASSERT_EQ(std::future_status::ready, f.wait_for(kBound));
+    done = true;
+    ASSERT_EQ(std::future_status::ready, churn.wait_for(kBound));
+
+    std::set<std::string> expected;
+    for (const auto& s : live) expected.insert(s.begin(), s.end());
+    for (const auto& on : {cache, makeCache()}) {
+        std::set<std::string> listed;
+        for (VSLContainerClass c : {2, 7}) {
+            VSLErrorRef error;
+            auto all = on->allContainersForUserIdentity(mobile, c, false, &error);
+            ASSERT_TRUE(all);
+            for (const auto& m : *all) listed.insert(m->url());
+        }
+        EXPECT_EQ(expected, listed);
+    }
+}
+
 TEST_F(ContainerCache, AnExceptionBecomesCode40AndLeavesTheCacheUsable) {
     makeContainer(mobile, 2, "com.a");
     bool thrown = false;

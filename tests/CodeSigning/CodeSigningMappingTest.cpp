@@ -137,14 +137,14 @@ TEST_F(CodeSigningTest, GroupsAreStagedOnlyForUsersWithAHome) {
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(appGroups(strings({"group.y"})), "A", std::nullopt, queue));
     EXPECT_EQ(1u, queue->pendingCount()) << "the personal user only: the enterprise home does not exist";
     EXPECT_TRUE(drain(queue)) << "a container not found does not fail the drain";
-    size_t personal = 0, all = 0;
+    size_t forPersonal = 0, all = 0;
     for (const auto& m : log_.messages()) {
         if (m.find("Failed to destroy group container with identifier group.x for ") == std::string::npos) continue;
         all++;
-        if (m.find("personaUniqueString = P-1,") != std::string::npos) personal++;
+        if (m.find("personaUniqueString = P-1,") != std::string::npos) forPersonal++;
     }
     EXPECT_EQ(1u, all) << "nothing is on disk, so the one staging reports its lookup failure";
-    EXPECT_EQ(1u, personal);
+    EXPECT_EQ(1u, forPersonal);
 
     codeSigningTestRoot().writeFile("private/var/enterprise/E-1/.keep", "");
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(std::nullopt, "A", std::nullopt, queue));

@@ -85,7 +85,7 @@ TEST(VSLSQLiteDB, SchemaAndSettingsAreMadeOnFirstOpenAndTheFileReopensIntact) {
 TEST(VSLSQLiteDB, TheDataBlobRoundTripsEveryPropertyListValueType) {
     auto db = VSLSQLiteDB::initWithParentDirectoryURL(freshDirectory("blob"));
     Uuid uuid = Uuid::random();
-    Date date{(Date::now().nanoseconds / 1000) * 1000};  // the format keeps microseconds
+    Date date{(Date::now().nanoseconds / 1000000000) * 1000000000};  // whole seconds survive the format exactly
     Value info = dict({
         {"string", Value::string("h\xC3\xA9llo, \"quoted\"")},
         {"empty", Value::string("")},

@@ -111,10 +111,19 @@ TEST(PersonaRules, IdentitiesFromRequests) {
     auto boundToE1 = clientAs(e1(), "com.example.mail");
     uint64_t code = 1;
 
+    // A persona-bound client that names no persona resolves to the unspecific
+    // identity, which is not its own.
+    EXPECT_EQ(nullptr, concreteIdentityFromRequest(
+                           dict({{"ContainerClass", Value::uint64(2)}, {"UUID", Value::uuid(Uuid::random())}}),
+                           nullptr, nullptr, nullptr, nullptr, *boundToE1, &code));
+    EXPECT_EQ(kVSLErrorWrongPersona, code);
+
     // No "Identifier": the client's own, where the command allows a default.
-    auto own = concreteIdentityFromRequest(
-        dict({{"ContainerClass", Value::uint64(2)}, {"UUID", Value::uuid(Uuid::random())}}), nullptr, nullptr,
-        nullptr, nullptr, *boundToE1, &code);
+    code = 1;
+    auto own = concreteIdentityFromRequest(dict({{"ContainerClass", Value::uint64(2)},
+                                                 {"UUID", Value::uuid(Uuid::random())},
+                                                 {"PersonaUniqueString", Value::string("E1")}}),
+                                           nullptr, nullptr, nullptr, nullptr, *boundToE1, &code);
     ASSERT_TRUE(own) << code;
     EXPECT_EQ("com.example.mail", own->identifier());
     EXPECT_TRUE(sameUserIdentity(e1(), own->userIdentity()));

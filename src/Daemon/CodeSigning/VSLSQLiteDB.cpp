@@ -14,11 +14,13 @@ const char* const kVSLCodeSigningDatabaseFileName = "containers.sqlite3";
 
 namespace {
 
+// Auto-vacuum comes first: it only takes on a file that has no page yet, and the
+// switch to the write-ahead journal writes the first one.
 const char* const kSchema =
+    "PRAGMA auto_vacuum = FULL;"
     "PRAGMA locking_mode = EXCLUSIVE;"
     "PRAGMA journal_mode = WAL;"
     "PRAGMA foreign_keys = ON;"
-    "PRAGMA auto_vacuum = FULL;"
     "CREATE TABLE IF NOT EXISTS code_signing_info ("
     "id INTEGER PRIMARY KEY AUTOINCREMENT, "
     "code_signing_id_text TEXT NOT NULL UNIQUE, "
