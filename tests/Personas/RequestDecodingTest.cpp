@@ -135,7 +135,9 @@ TEST(PersonaRules, IdentitiesFromRequests) {
 
     code = 1;
     EXPECT_EQ(nullptr, concreteIdentityFromRequestIdentifier(
-                           dict({{"Identifier", Value::string("x")}, {"ContainerClass", Value::uint64(2)}}),
+                           dict({{"Identifier", Value::string("x")},
+                                 {"ContainerClass", Value::uint64(2)},
+                                 {"PersonaUniqueString", Value::string("E1")}}),
                            *boundToE1, &code));
     EXPECT_EQ(kVSLErrorInvalidObject, code) << "no UUID";
 
