@@ -71,9 +71,19 @@ inline double median(std::vector<double> v) {
     return n % 2 ? v[n / 2] : (v[n / 2 - 1] + v[n / 2]) / 2;
 }
 
-inline void printRatio(const char* what, double ours, double reference, const char* referenceName) {
-    std::printf("%s: vesseld %.1f ms, %s %.1f ms\n", what, ours, referenceName, reference);
-    std::printf("ratio %s vesseld/%s = %.2f\n", what, referenceName, ours / reference);
+inline std::string runs(const std::vector<double>& v) {
+    std::string s;
+    for (double ms : v) s += (s.empty() ? "" : " ") + std::to_string(static_cast<long>(ms));
+    return s;
+}
+
+// Medians of both sides, every run, and the ratio line.
+inline void printRatio(const char* what, const std::vector<double>& ours, const std::vector<double>& reference,
+                       const char* referenceName) {
+    double a = median(ours), b = median(reference);
+    std::printf("%s: vesseld %.1f ms [runs %s], %s %.1f ms [runs %s]\n", what, a, runs(ours).c_str(), referenceName,
+                b, runs(reference).c_str());
+    std::printf("ratio %s vesseld/%s = %.2f\n", what, referenceName, a / b);
 }
 
 }  // namespace fsbench

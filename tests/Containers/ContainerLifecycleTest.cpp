@@ -206,3 +206,44 @@ TEST(DeathRow, LeftoversGoAtStartAndOnRequest) {
     EXPECT_NE(0, ::access((dead + "/LATER").c_str(), F_OK)) << "the reply comes after the destruction";
     EXPECT_EQ(0, ::access(dead.c_str(), F_OK)) << "death row itself stays";
 }
+
+TEST(CrashSafety, KillDuringCreationsLeavesOnlyCompleteContainers) {
+    DaemonProcess daemon;
+    std::string admin = daemon.addClient("admin", "com.example.admin",
+                                         dict({{"com.tarrow.private.Vesselry.allowed", Value::boolean(true)}}));
+    ASSERT_TRUE(daemon.start());
+    std::vector<std::thread> burst;
+    for (int i = 0; i < 24; i++)
+        burst.emplace_back([&, i] {
+            daemon.run(admin, {"createOrLookup", "Identifier=com.example.burst" + std::to_string(i), "ContainerClass=2",
+                               "CreateIfNecessary=true"});
+        });
+    std::this_thread::sleep_for(std::chrono::milliseconds(60));
+    daemon.kill();
+    for (auto& t : burst) t.join();
+
+    ASSERT_TRUE(daemon.start());
+    auto listed = daemon.run(admin, {"containersWithClass", "ContainerClass=2"});
+    ASSERT_EQ(1u, code(listed)) << listed.err;
+    size_t known = listed.reply.find("ReplyIdsArray")->arrayValue()->size();
+    std::string classDir = daemon.at("private/var/mobile/Containers/Data/Application");
+    size_t onDisk = 0;
+    if (auto d = opendir(classDir.c_str())) {
+        while (auto e = readdir(d)) {
+            if (e->d_name[0] == '.') continue;
+            onDisk++;
+            std::string metadata = classDir + "/" + e->d_name + "/.com.tarrow.vesselry.metadata.plist";
+            EXPECT_EQ(0, ::access(metadata.c_str(), F_OK)) << e->d_name << " is incomplete";
+            EXPECT_EQ(0, ::access((classDir + "/" + e->d_name + "/Library/Preferences").c_str(), F_OK))
+                << e->d_name << " lacks its skeleton";
+        }
+        closedir(d);
+    }
+    EXPECT_EQ(known, onDisk) << "every directory in the class is a container the daemon knows";
+    // And every one of the burst is either complete or absent: creating again works.
+    for (int i = 0; i < 24; i++) {
+        auto r = daemon.run(admin, {"createOrLookup", "Identifier=com.example.burst" + std::to_string(i),
+                                    "ContainerClass=2", "CreateIfNecessary=true"});
+        EXPECT_EQ(1u, code(r)) << i;
+    }
+}
