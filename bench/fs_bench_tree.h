@@ -77,6 +77,11 @@ inline std::string runs(const std::vector<double>& v) {
     return s;
 }
 
+inline void printRatio(const char* what, double ours, double reference, const char* referenceName) {
+    std::printf("%s: vesseld %.1f ms, %s %.1f ms\n", what, ours, referenceName, reference);
+    std::printf("ratio %s vesseld/%s = %.2f\n", what, referenceName, ours / reference);
+}
+
 // Medians of both sides, every run, and the ratio line.
 inline void printRatio(const char* what, const std::vector<double>& ours, const std::vector<double>& reference,
                        const char* referenceName) {
