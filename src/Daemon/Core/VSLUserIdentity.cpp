@@ -33,7 +33,8 @@ VSLUserIdentityRef VSLUserIdentity::create(uid_t uid, gid_t gid, std::string hom
 }
 
 VSLUserIdentityRef VSLUserIdentity::legacyMobile() {
-    return create(501, 501, VSLFileManager::homeDirectoryURLForPOSIXUID(501), std::nullopt, kVSLPersonaTypePersonal, 501);
+    return create(501, 501, VSLFileManager::homeDirectoryURLForPOSIXUID(501), std::nullopt, kVSLPersonaTypePersonal,
+                  501);
 }
 
 namespace {
