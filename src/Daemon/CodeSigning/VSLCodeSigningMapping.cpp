@@ -152,13 +152,16 @@ std::optional<Value> VSLCodeSigningMapping::entitlementsForIdentifier(const std:
 
 std::optional<Value> VSLCodeSigningMapping::getCodeSigningInfoForIdentifier(const std::string& identifier) {
     GlobalWriteLock lock;
-    entitlementsForIdentifier(identifier);  // for its import
-    std::optional<Value> info;
-    queue_->sync([&] {
-        auto entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr);
-        if (entry && !entry->placeholder && !entry->advanceCopy && !entry->invalid) info = entry->codeSigningInfo;
-    });
-    return info;
+    std::optional<VSLCodeSigningEntry> entry;
+    queue_->sync([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr); });
+    // Stored entitlements mean there is nothing to import; otherwise look at the bundle
+    // container first, then read what that may have stored.
+    if (!entry || !entry->entitlements()) {
+        entitlementsForIdentifier(identifier);
+        queue_->sync([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr); });
+    }
+    if (entry && !entry->placeholder && !entry->advanceCopy && !entry->invalid) return entry->codeSigningInfo;
+    return std::nullopt;
 }
 
 std::optional<std::vector<std::string>> VSLCodeSigningMapping::appGroupIdentifiersForIdentifier(

@@ -2,6 +2,8 @@
 
 #include <sqlite3.h>
 
+#include <mutex>
+
 #include "Daemon/CodeSigning/VSLSQLiteStatement.h"
 #include "Daemon/Core/VSLExceptionGuard.h"
 #include "Daemon/Core/VSLInvariant.h"
@@ -107,6 +109,11 @@ std::unique_ptr<VSLSQLiteDB> VSLSQLiteDB::initWithParentDirectoryURL(const std::
 }
 
 sqlite3* VSLSQLiteDB::openDBWithURL(const std::string& url) {
+    // Memory statistics put a process-wide mutex around every allocation, and every
+    // statement is prepared afresh; nothing here reads the statistics. Only takes
+    // effect before SQLite's first use.
+    static std::once_flag configureOnce;
+    std::call_once(configureOnce, [] { sqlite3_config(SQLITE_CONFIG_MEMSTATUS, 0); });
     sqlite3* db = nullptr;
     int rc = sqlite3_open_v2(url.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
     if (rc != SQLITE_OK) {
