@@ -27,8 +27,8 @@
 #include <thread>
 #include <vector>
 
+#include "bench_daemon.h"
 #include "Client/VSLConnection.h"
-#include "Daemon/Core/VSLPropertyListFile.h"
 #include "Platform/IpcWire.h"
 
 using namespace vsl;
@@ -41,13 +41,6 @@ double usSince(Clock::time_point t) { return std::chrono::duration<double, std::
 double median(std::vector<double> v) {
     std::sort(v.begin(), v.end());
     return v.empty() ? 0 : v[v.size() / 2];
-}
-
-std::string selfPath() {
-    char buf[PATH_MAX];
-    ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
-    buf[n > 0 ? n : 0] = 0;
-    return buf;
 }
 
 bool readAll(int fd, void* p, size_t n) {
@@ -141,38 +134,14 @@ double bareCreateMicros(const std::string& dir, int n) {
 
 int main(int argc, char** argv) {
     int n = argc > 1 ? std::atoi(argv[1]) : 5000;
-    char templ[] = "/tmp/vessel-bench-XXXXXX";
-    std::string root = mkdtemp(templ);
-    std::string daemonPath = selfPath();
-    daemonPath = daemonPath.substr(0, daemonPath.rfind('/')) + "/../src/vesseld";
-
-    std::string policyDir = root + "/etc/vesseld/code-signatures";
-    std::system(("mkdir -p '" + policyDir + "'").c_str());
-    VSLErrorRef error;
-    VSL_writeToURL(dict({{"Executable", Value::string(selfPath())},
-                         {"SigningIdentifier", Value::string("com.example.bench")},
-                         {"Entitlements", dict({{"com.tarrow.private.Vesselry.allowed", Value::boolean(true)}})}}),
-                   policyDir + "/bench.plist", kVSLWriteAtomic, &error);
-    chmod((policyDir + "/bench.plist").c_str(), 0644);
-
-    pid_t pid = fork();
-    if (pid == 0) {
-        setenv("VESSELD_OSLOG", "off", 1);
-        int devnull = open("/dev/null", O_WRONLY);
-        dup2(devnull, 2);
-        execl(daemonPath.c_str(), daemonPath.c_str(), "--root", root.c_str(), "--init", nullptr);
-        _exit(127);
-    }
-    std::string socketPath = client::VSLConnection::socketPathForSystemRoot(root);
-    std::shared_ptr<client::VSLConnection> c;
-    for (int i = 0; i < 400 && !c; i++) {
-        c = client::VSLConnection::connect(socketPath, nullptr);
-        if (!c) std::this_thread::sleep_for(std::chrono::milliseconds(25));
-    }
-    if (!c) {
-        std::fprintf(stderr, "daemon did not start (%s)\n", daemonPath.c_str());
+    vslbench::BenchDaemon daemon;
+    if (!daemon.start()) {
+        std::fprintf(stderr, "daemon did not start\n");
         return 1;
     }
+    const auto& c = daemon.connection();
+    const std::string& root = daemon.root();
+    std::string socketPath = client::VSLConnection::socketPathForSystemRoot(root);
     auto call = [&](const std::shared_ptr<client::VSLConnection>& conn, const Value& req) {
         auto r = conn->sendRequest(req, std::chrono::seconds(30));
         return r.ok() && r.body.find("ReplyError")->uint64Value() == 1u;
@@ -245,8 +214,5 @@ int main(int argc, char** argv) {
     std::printf("bare create (floor)        %8.1f us\n", bareCreate);
     std::printf("lookups/s, %d clients       %8.0f\n", clients, total / seconds);
 
-    kill(pid, SIGTERM);
-    waitpid(pid, nullptr, 0);
-    std::system(("rm -rf '" + root + "'").c_str());
     return 0;
 }

@@ -16,20 +16,12 @@
 #include <string>
 #include <thread>
 
-#include "Client/VSLConnection.h"
-#include "Daemon/Core/VSLPropertyListFile.h"
+#include "bench_daemon.h"
 
 using namespace vsl;
 using Clock = std::chrono::steady_clock;
 
 namespace {
-
-std::string selfPath() {
-    char buf[PATH_MAX];
-    ssize_t n = readlink("/proc/self/exe", buf, sizeof buf - 1);
-    buf[n > 0 ? n : 0] = 0;
-    return buf;
-}
 
 void fillTree(const std::string& dir, int files) {
     for (int i = 0; i < files; i++) {
@@ -50,32 +42,10 @@ double msSince(Clock::time_point t) { return std::chrono::duration<double, std::
 
 int main(int argc, char** argv) {
     int files = argc > 1 ? std::atoi(argv[1]) : 50000;
-    char templ[] = "/tmp/vessel-delbench-XXXXXX";
-    std::string root = mkdtemp(templ);
-    std::string daemonPath = selfPath();
-    daemonPath = daemonPath.substr(0, daemonPath.rfind('/')) + "/../src/vesseld";
-    std::string policyDir = root + "/etc/vesseld/code-signatures";
-    std::system(("mkdir -p '" + policyDir + "'").c_str());
-    VSLErrorRef error;
-    VSL_writeToURL(dict({{"Executable", Value::string(selfPath())},
-                         {"SigningIdentifier", Value::string("com.example.bench")},
-                         {"Entitlements", dict({{"com.tarrow.private.Vesselry.allowed", Value::boolean(true)}})}}),
-                   policyDir + "/bench.plist", kVSLWriteAtomic, &error);
-    chmod((policyDir + "/bench.plist").c_str(), 0644);
-    pid_t pid = fork();
-    if (pid == 0) {
-        setenv("VESSELD_OSLOG", "off", 1);
-        int devnull = open("/dev/null", O_WRONLY);
-        dup2(devnull, 2);
-        execl(daemonPath.c_str(), daemonPath.c_str(), "--root", root.c_str(), "--init", nullptr);
-        _exit(127);
-    }
-    std::shared_ptr<client::VSLConnection> c;
-    for (int i = 0; i < 400 && !c; i++) {
-        c = client::VSLConnection::connect(client::VSLConnection::socketPathForSystemRoot(root), nullptr);
-        if (!c) std::this_thread::sleep_for(std::chrono::milliseconds(25));
-    }
-    if (!c) return 1;
+    vslbench::BenchDaemon daemon;
+    if (!daemon.start()) return 1;
+    const auto& c = daemon.connection();
+    const std::string& root = daemon.root();
     auto r = c->sendRequest(dict({{"Command", Value::uint64(0)},
                                   {"Identifier", Value::string("com.example.big")},
                                   {"ContainerClass", Value::uint64(2)},
@@ -104,8 +74,5 @@ int main(int argc, char** argv) {
                 (unsigned long long)d.body.find("ReplyError")->uint64Value().value_or(0));
     std::printf("rm -rf of the same tree   %10.2f ms\n", rm);
     std::printf("ratio reply / rm -rf      %10.4f\n", reply / rm);
-    kill(pid, SIGTERM);
-    waitpid(pid, nullptr, 0);
-    std::system(("rm -rf '" + root + "'").c_str());
     return 0;
 }

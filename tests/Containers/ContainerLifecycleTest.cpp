@@ -21,11 +21,6 @@ using namespace vsl::test;
 
 namespace {
 
-uint64_t code(const DaemonProcess::CtlResult& r) {
-    const Value* c = r.reply.find("ReplyError");
-    return c && c->uint64Value() ? *c->uint64Value() : 0;
-}
-
 std::string str(const DaemonProcess::CtlResult& r, const char* key) {
     const Value* v = r.reply.find(key);
     return v && v->stringValue() ? *v->stringValue() : std::string();
@@ -60,7 +55,7 @@ protected:
 
 TEST_F(Containers, OwnDataContainerIsMadeOnceAndFoundAgain) {
     auto made = daemon.run(app, {"createOrLookup", "ContainerClass=2", "CreateIfNecessary=true"});
-    ASSERT_EQ(1u, code(made)) << made.err;
+    ASSERT_EQ(1u, made.code()) << made.err;
     EXPECT_FALSE(existed(made));
     EXPECT_EQ("com.example.app", str(made, "ReplyIdentifier")) << "no Identifier: the client's own";
     std::string path = str(made, "ReplyPath");
@@ -81,7 +76,7 @@ TEST_F(Containers, OwnDataContainerIsMadeOnceAndFoundAgain) {
     EXPECT_EQ(0, ::access((path + "/.com.tarrow.vesselry.metadata.plist").c_str(), F_OK));
 
     auto again = daemon.run(app, {"createOrLookup", "ContainerClass=2"});
-    ASSERT_EQ(1u, code(again));
+    ASSERT_EQ(1u, again.code());
     EXPECT_TRUE(existed(again));
     EXPECT_EQ(uuid(made), uuid(again));
     EXPECT_EQ(path, str(again, "ReplyPath"));
@@ -90,20 +85,20 @@ TEST_F(Containers, OwnDataContainerIsMadeOnceAndFoundAgain) {
     ASSERT_EQ(0, daemon.stop());
     ASSERT_TRUE(daemon.start());
     auto afterRestart = daemon.run(app, {"createOrLookup", "ContainerClass=2"});
-    ASSERT_EQ(1u, code(afterRestart));
+    ASSERT_EQ(1u, afterRestart.code());
     EXPECT_TRUE(existed(afterRestart));
     EXPECT_EQ(uuid(made), uuid(afterRestart));
 }
 
 TEST_F(Containers, AbsentOrForeignContainersAreRefused) {
-    EXPECT_EQ(21u, code(daemon.run(app, {"createOrLookup", "ContainerClass=4"}))) << "create false, absent";
-    EXPECT_EQ(55u, code(daemon.run(app, {"createOrLookup", "Identifier=com.example.other", "ContainerClass=2",
-                                         "CreateIfNecessary=true"})))
+    EXPECT_EQ(21u, daemon.run(app, {"createOrLookup", "ContainerClass=4"}).code()) << "create false, absent";
+    EXPECT_EQ(55u, daemon.run(app, {"createOrLookup", "Identifier=com.example.other", "ContainerClass=2",
+                                         "CreateIfNecessary=true"}).code())
         << "another identifier without rights";
-    EXPECT_EQ(20u, code(daemon.run(app, {"createOrLookup", "ContainerClass=0"})));
-    EXPECT_EQ(20u, code(daemon.run(app, {"createOrLookup", "ContainerClass=14"})));
-    EXPECT_EQ(18u, code(daemon.run(admin, {"deleteContainer", "ContainerClass=2"}))) << "delete needs an Identifier";
-    EXPECT_EQ(21u, code(daemon.run(admin, {"deleteContainer", "Identifier=com.example.none", "ContainerClass=2"})));
+    EXPECT_EQ(20u, daemon.run(app, {"createOrLookup", "ContainerClass=0"}).code());
+    EXPECT_EQ(20u, daemon.run(app, {"createOrLookup", "ContainerClass=14"}).code());
+    EXPECT_EQ(18u, daemon.run(admin, {"deleteContainer", "ContainerClass=2"}).code()) << "delete needs an Identifier";
+    EXPECT_EQ(21u, daemon.run(admin, {"deleteContainer", "Identifier=com.example.none", "ContainerClass=2"}).code());
 }
 
 TEST_F(Containers, ConcurrentCreatorsGetOneContainer) {
@@ -118,14 +113,14 @@ TEST_F(Containers, ConcurrentCreatorsGetOneContainer) {
     std::set<std::string> uuids;
     int created = 0;
     for (auto& r : results) {
-        ASSERT_EQ(1u, code(r)) << r.err;
+        ASSERT_EQ(1u, r.code()) << r.err;
         uuids.insert(uuid(r));
         created += existed(r) ? 0 : 1;
     }
     EXPECT_EQ(1u, uuids.size());
     EXPECT_EQ(1, created) << "exactly one caller made it";
     auto listed = daemon.run(admin, {"containersWithClass", "ContainerClass=2"});
-    ASSERT_EQ(1u, code(listed));
+    ASSERT_EQ(1u, listed.code());
     size_t shared = 0;
     for (const auto& id : *listed.reply.find("ReplyIdsArray")->arrayValue())
         shared += *id.stringValue() == "com.example.shared";
@@ -135,26 +130,26 @@ TEST_F(Containers, ConcurrentCreatorsGetOneContainer) {
 TEST_F(Containers, TransientRecreateAndDelete) {
     auto first = daemon.run(admin, {"createOrLookup", "Identifier=com.example.t", "ContainerClass=2", "Transient=true",
                                     "CreateIfNecessary=true"});
-    ASSERT_EQ(1u, code(first)) << first.err;
+    ASSERT_EQ(1u, first.code()) << first.err;
     auto second = daemon.run(admin, {"createOrLookup", "Identifier=com.example.t", "ContainerClass=2",
                                      "Transient=true", "CreateIfNecessary=true"});
-    ASSERT_EQ(1u, code(second));
+    ASSERT_EQ(1u, second.code());
     EXPECT_NE(uuid(first), uuid(second)) << "a transient request never returns the old transient container";
     EXPECT_NE(0, ::access(str(first, "ReplyPath").c_str(), F_OK)) << "the old one left its place for death row";
 
     auto made = daemon.run(admin, {"createOrLookup", "Identifier=com.example.d", "ContainerClass=2",
                                    "CreateIfNecessary=true"});
-    ASSERT_EQ(1u, code(made));
-    EXPECT_EQ(1u, code(daemon.run(admin, {"deleteContainer", "Identifier=com.example.d", "ContainerClass=2"})));
+    ASSERT_EQ(1u, made.code());
+    EXPECT_EQ(1u, daemon.run(admin, {"deleteContainer", "Identifier=com.example.d", "ContainerClass=2"}).code());
     EXPECT_NE(0, ::access(str(made, "ReplyPath").c_str(), F_OK)) << "gone from its class directory at the reply";
-    EXPECT_EQ(21u, code(daemon.run(admin, {"createOrLookup", "Identifier=com.example.d", "ContainerClass=2"})));
+    EXPECT_EQ(21u, daemon.run(admin, {"createOrLookup", "Identifier=com.example.d", "ContainerClass=2"}).code());
 }
 
 TEST_F(Containers, FailureAfterStagingLeavesNothingBehind) {
     // An immutable class directory: lookups still read it, the final move into it fails.
     auto made = daemon.run(admin, {"createOrLookup", "Identifier=com.example.first", "ContainerClass=4",
                                    "CreateIfNecessary=true"});
-    ASSERT_EQ(1u, code(made));
+    ASSERT_EQ(1u, made.code());
     std::string classDir = daemon.at("private/var/mobile/Containers/Data/PluginKitPlugin");
     int fd = ::open(classDir.c_str(), O_RDONLY | O_DIRECTORY);
     ASSERT_GE(fd, 0);
@@ -167,7 +162,7 @@ TEST_F(Containers, FailureAfterStagingLeavesNothingBehind) {
                                 "CreateIfNecessary=true"});
     setFileFlags(fd, classDir, flags);
     ::close(fd);
-    EXPECT_EQ(8u, code(r)) << r.err;
+    EXPECT_EQ(8u, r.code()) << r.err;
 
     size_t inClass = 0;
     if (auto d = opendir(classDir.c_str())) {
@@ -201,7 +196,7 @@ TEST(DeathRow, LeftoversGoAtStartAndOnRequest) {
 
     ASSERT_EQ(0, std::system(("mkdir -p '" + dead + "/LATER'").c_str()));
     auto r = daemon.run(cleaner, {"deleteContainersOnDeathRow"});
-    EXPECT_EQ(1u, code(r)) << r.err;
+    EXPECT_EQ(1u, r.code()) << r.err;
     EXPECT_EQ(1u, r.reply.dictionaryValue()->size()) << "only ReplyError, sent from the completion";
     EXPECT_NE(0, ::access((dead + "/LATER").c_str(), F_OK)) << "the reply comes after the destruction";
     EXPECT_EQ(0, ::access(dead.c_str(), F_OK)) << "death row itself stays";
@@ -224,7 +219,7 @@ TEST(CrashSafety, KillDuringCreationsLeavesOnlyCompleteContainers) {
 
     ASSERT_TRUE(daemon.start());
     auto listed = daemon.run(admin, {"containersWithClass", "ContainerClass=2"});
-    ASSERT_EQ(1u, code(listed)) << listed.err;
+    ASSERT_EQ(1u, listed.code()) << listed.err;
     size_t known = listed.reply.find("ReplyIdsArray")->arrayValue()->size();
     std::string classDir = daemon.at("private/var/mobile/Containers/Data/Application");
     size_t onDisk = 0;
@@ -244,6 +239,6 @@ TEST(CrashSafety, KillDuringCreationsLeavesOnlyCompleteContainers) {
     for (int i = 0; i < 24; i++) {
         auto r = daemon.run(admin, {"createOrLookup", "Identifier=com.example.burst" + std::to_string(i),
                                     "ContainerClass=2", "CreateIfNecessary=true"});
-        EXPECT_EQ(1u, code(r)) << i;
+        EXPECT_EQ(1u, r.code()) << i;
     }
 }

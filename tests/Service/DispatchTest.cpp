@@ -19,11 +19,6 @@ namespace {
 
 const char* const kAllowed = "com.tarrow.private.Vesselry.allowed";
 
-uint64_t replyCode(const DaemonProcess::CtlResult& r) {
-    const Value* c = r.reply.find("ReplyError");
-    return c && c->uint64Value() ? *c->uint64Value() : 0;
-}
-
 size_t replyKeyCount(const DaemonProcess::CtlResult& r) {
     return r.reply.dictionaryValue() ? r.reply.dictionaryValue()->size() : 0;
 }
@@ -61,7 +56,7 @@ std::string Dispatch::allowed, Dispatch::nothing, Dispatch::tester, Dispatch::lo
 TEST_F(Dispatch, InvalidAndRetiredCommandNumbers) {
     for (const char* number : {"33", "18446744073709551615", "27"}) {
         auto r = daemon->run(allowed, {number});
-        EXPECT_EQ(49u, replyCode(r)) << number << " " << r.err;
+        EXPECT_EQ(49u, r.code()) << number << " " << r.err;
         EXPECT_EQ(1u, replyKeyCount(r)) << "only ReplyError: " << number;
         EXPECT_EQ(1, r.exitCode);
     }
@@ -69,35 +64,35 @@ TEST_F(Dispatch, InvalidAndRetiredCommandNumbers) {
 
 TEST_F(Dispatch, EntitlementsDecideRights) {
     auto ok = daemon->run(allowed, {"personaUniqueStrings"});
-    EXPECT_EQ(1u, replyCode(ok)) << ok.err;
+    EXPECT_EQ(1u, ok.code()) << ok.err;
     EXPECT_TRUE(ok.reply.find("ReplyPersonaUniqueStringsArray")) << "the handler ran";
     EXPECT_EQ(0, ok.exitCode);
 
     // A client without entitlements: refused where the command needs them.
-    EXPECT_EQ(55u, replyCode(daemon->run(nothing, {"deleteContainer", "Identifier=x"})));
-    EXPECT_EQ(55u, replyCode(daemon->run(nothing, {"containersWithClass", "ContainerClass=2"})));
+    EXPECT_EQ(55u, daemon->run(nothing, {"deleteContainer", "Identifier=x"}).code());
+    EXPECT_EQ(55u, daemon->run(nothing, {"containersWithClass", "ContainerClass=2"}).code());
     // ...but command 32 admits unentitled clients, restricted to their own.
-    EXPECT_EQ(1u, replyCode(daemon->run(nothing, {"personaUniqueStrings"})));
+    EXPECT_EQ(1u, daemon->run(nothing, {"personaUniqueStrings"}).code());
 
     // The general entitlement does not stand in for the testability one.
-    EXPECT_EQ(55u, replyCode(daemon->run(allowed, {"retryTest", "NumRetryCrashes=0"})));
-    EXPECT_EQ(55u, replyCode(daemon->run(allowed, {"setTestLock", "TestLock=0", "Enable=false"})));
-    EXPECT_NE(55u, replyCode(daemon->run(tester, {"setTestLock", "TestLock=0", "Enable=false"})));
+    EXPECT_EQ(55u, daemon->run(allowed, {"retryTest", "NumRetryCrashes=0"}).code());
+    EXPECT_EQ(55u, daemon->run(allowed, {"setTestLock", "TestLock=0", "Enable=false"}).code());
+    EXPECT_NE(55u, daemon->run(tester, {"setTestLock", "TestLock=0", "Enable=false"}).code());
 
     // A lookup dictionary alone admits the lookup commands 1, 14 and 23 (and not 10).
     for (const char* command : {"containersWithClass", "groupContainerIdentifiers", "diskUsage"}) {
-        EXPECT_NE(55u, replyCode(daemon->run(lookupOnly, {command, "ContainerClass=2", "Identifier=a"})))
+        EXPECT_NE(55u, daemon->run(lookupOnly, {command, "ContainerClass=2", "Identifier=a"}).code())
             << command;
-        EXPECT_EQ(55u, replyCode(daemon->run(nothing, {command, "ContainerClass=2", "Identifier=a"}))) << command;
+        EXPECT_EQ(55u, daemon->run(nothing, {command, "ContainerClass=2", "Identifier=a"}).code()) << command;
     }
-    EXPECT_EQ(55u, replyCode(daemon->run(lookupOnly, {"deleteContainer", "Identifier=a"})));
+    EXPECT_EQ(55u, daemon->run(lookupOnly, {"deleteContainer", "Identifier=a"}).code());
 }
 
 TEST_F(Dispatch, MissingOrMistypedCommandIsCommandZero) {
     // Command 0 admits unentitled clients; command 1 does not. A request without a
     // usable "Command" must therefore pass the rights check for this client.
     auto explicitOne = daemon->run(nothing, {"1"});
-    EXPECT_EQ(55u, replyCode(explicitOne));
+    EXPECT_EQ(55u, explicitOne.code());
 
     std::string error;
     auto c = client::VSLConnection::connect(daemon->socketPath(), &error);

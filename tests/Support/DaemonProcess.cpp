@@ -178,6 +178,11 @@ std::string DaemonProcess::addClient(const std::string& name, const std::string&
     return path;
 }
 
+uint64_t DaemonProcess::CtlResult::code() const {
+    const Value* c = reply.find("ReplyError");
+    return c && c->uint64Value() ? *c->uint64Value() : 0;
+}
+
 DaemonProcess::CtlResult DaemonProcess::run(const std::string& client, const std::vector<std::string>& args) const {
     std::vector<std::string> argv = {client, "--root", root_, "--plist"};
     argv.insert(argv.end(), args.begin(), args.end());

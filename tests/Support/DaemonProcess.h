@@ -46,7 +46,9 @@ public:
         int exitCode = -1;
         std::string out;
         std::string err;
-        Value reply;  // parsed back from --json output when it was JSON we can read
+        Value reply;  // parsed back from the --plist output
+        // "ReplyError", or 0 when there is no readable reply.
+        uint64_t code() const;
     };
     // Runs a client program (a path from addClient, or vesselctlPath()) with --root.
     CtlResult run(const std::string& client, const std::vector<std::string>& args) const;

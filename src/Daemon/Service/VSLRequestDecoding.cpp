@@ -40,6 +40,15 @@ namespace {
 // The host's multi-user flag; a device without the notion is single-user.
 bool isMultiUserDevice() { return deviceFacts().multiUser; }
 
+// With no key name "Identifier" defaults to the client's own; a named key has no default.
+std::optional<std::string> requestIdentifier(const Value& request, const char* identifierKey,
+                                             VSLClientConnection& connection, uint64_t* code) {
+    auto identifier = identifierKey ? stringFromRequest(request, identifierKey)
+                                    : identifierFromRequest(request, connection.clientBundleIdentifier());
+    if (!identifier && code) *code = kVSLErrorMissingIdentifier;
+    return identifier;
+}
+
 VSLUserIdentityRef clientUserIdentity(VSLClientConnection& connection) {
     return connection.clientIdentity() ? connection.clientIdentity()->userIdentity() : nullptr;
 }
@@ -108,13 +117,8 @@ VSLConcreteContainerIdentityRef concreteIdentityFromRequest(const Value& request
                                                             const char* classKey, const char* uuidKey,
                                                             const char* personaKey, VSLClientConnection& connection,
                                                             uint64_t* code) {
-    std::optional<std::string> identifier =
-        identifierKey ? stringFromRequest(request, identifierKey)
-                      : identifierFromRequest(request, connection.clientBundleIdentifier());
-    if (!identifier) {
-        if (code) *code = kVSLErrorMissingIdentifier;
-        return nullptr;
-    }
+    auto identifier = requestIdentifier(request, identifierKey, connection, code);
+    if (!identifier) return nullptr;
     VSLContainerClass containerClass = uint64FromRequest(request, classKey ? classKey : "ContainerClass").value_or(0);
     const Value* uuid = request.find(uuidKey ? uuidKey : "UUID");
 
@@ -142,13 +146,8 @@ VSLConcreteContainerIdentityRef concreteIdentityFromRequestIdentifier(const Valu
 
 VSLContainerIdentityRef identityFromRequest(const Value& request, const char* identifierKey, const char* classKey,
                                             VSLClientConnection& connection, uint64_t* code) {
-    std::optional<std::string> identifier =
-        identifierKey ? stringFromRequest(request, identifierKey)
-                      : identifierFromRequest(request, connection.clientBundleIdentifier());
-    if (!identifier) {
-        if (code) *code = kVSLErrorMissingIdentifier;
-        return nullptr;
-    }
+    auto identifier = requestIdentifier(request, identifierKey, connection, code);
+    if (!identifier) return nullptr;
     VSLContainerClass containerClass = uint64FromRequest(request, classKey ? classKey : "ContainerClass").value_or(0);
     if (!isValidContainerClass(containerClass)) {
         if (code) *code = kVSLErrorUnexpectedClass;
