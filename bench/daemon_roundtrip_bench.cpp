@@ -54,7 +54,8 @@ bool readAll(int fd, void* p, size_t n) {
     return true;
 }
 
-// The floor: read a length-prefixed frame, write a canned reply frame, one thread.
+// The floor: read a length-prefixed frame, write a canned reply frame, in a process
+// of its own as the daemon is.
 double bareEchoMicros(const std::string& dir, size_t requestBytes, size_t replyBytes, int n) {
     std::string path = dir + "/echo.sock";
     int listener = socket(AF_UNIX, SOCK_STREAM, 0);
@@ -63,7 +64,8 @@ double bareEchoMicros(const std::string& dir, size_t requestBytes, size_t replyB
     std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
     bind(listener, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
     listen(listener, 4);
-    std::thread server([&] {
+    pid_t server = fork();
+    if (server == 0) {
         int fd = accept(listener, nullptr, nullptr);
         std::string reply(replyBytes, 'r');
         std::vector<char> buf(1 << 16);
@@ -76,7 +78,8 @@ double bareEchoMicros(const std::string& dir, size_t requestBytes, size_t replyB
             if (write(fd, frame.data(), frame.size()) != static_cast<ssize_t>(frame.size())) break;
         }
         close(fd);
-    });
+        _exit(0);
+    }
     int c = socket(AF_UNIX, SOCK_STREAM, 0);
     connect(c, reinterpret_cast<sockaddr*>(&addr), sizeof addr);
     std::string request(requestBytes, 'q');
@@ -94,7 +97,7 @@ double bareEchoMicros(const std::string& dir, size_t requestBytes, size_t replyB
         samples.push_back(usSince(t));
     }
     close(c);
-    server.join();
+    waitpid(server, nullptr, 0);
     close(listener);
     unlink(path.c_str());
     return median(samples);
