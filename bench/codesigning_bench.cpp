@@ -22,7 +22,9 @@ namespace {
 constexpr int kIdentifiers = 10000;
 constexpr int kGroupDrops = 100;
 
-std::string identifierAt(int i) { return "com.example.bench.app" + std::to_string(i); }
+std::string identifierAt(int i) {
+    return "com.example.bench.app" + std::to_string(i);
+}
 
 Value infoFor(int i, bool withSecondGroup = true) {
     Array groups{Value::string("group.com.example.bench.g" + std::to_string(i % 50))};
@@ -65,8 +67,8 @@ struct Figures {
 
 Figures runMapping(const std::string& dir) {
     Figures f;
-    auto mapping = VSLCodeSigningMapping::create(VSLSQLiteDB::initWithParentDirectoryURL(dir),
-                                                 VSLUserIdentityCache::create());
+    auto mapping =
+        VSLCodeSigningMapping::create(VSLSQLiteDB::initWithParentDirectoryURL(dir), VSLUserIdentityCache::create());
     VSLCodeSigningMapping::setSharedInstanceForTesting(mapping);
     std::vector<Value> infos;
     for (int i = 0; i < kIdentifiers; i++) infos.push_back(infoFor(i));
@@ -82,8 +84,8 @@ Figures runMapping(const std::string& dir) {
             if (!mapping->getCodeSigningInfoForIdentifier(identifierAt(i))) std::exit(1);
     });
     // What every entitled message pays: its sender's unchanged entitlements.
-    mapping->processCallerRegisteredEntitlements(dict({{"com.example.flag", Value::boolean(true)}}), "com.example.client",
-                                                 VSLCommandQueue::create());
+    mapping->processCallerRegisteredEntitlements(dict({{"com.example.flag", Value::boolean(true)}}),
+                                                 "com.example.client", VSLCommandQueue::create());
     f.callerCheckMs = fsbench::millisecondsOf([&] {
         for (int i = 0; i < kIdentifiers; i++)
             mapping->processCallerRegisteredEntitlements(dict({{"com.example.flag", Value::boolean(true)}}),
@@ -176,9 +178,10 @@ int main() {
                 fsbench::median(caller) * 1000 / kIdentifiers);
     std::printf("registration dropping a group (recounts %d entries): %.2f ms each\n", kIdentifiers,
                 fsbench::median(drop) / kGroupDrops);
-    std::printf("database after %d identifiers: containers.sqlite3 %llu bytes (%.0f bytes/identifier), -wal %llu bytes\n",
-                kIdentifiers, static_cast<unsigned long long>(last.dbBytes),
-                static_cast<double>(last.dbBytes) / kIdentifiers, static_cast<unsigned long long>(last.walBytes));
+    std::printf(
+        "database after %d identifiers: containers.sqlite3 %llu bytes (%.0f bytes/identifier), -wal %llu bytes\n",
+        kIdentifiers, static_cast<unsigned long long>(last.dbBytes), static_cast<double>(last.dbBytes) / kIdentifiers,
+        static_cast<unsigned long long>(last.walBytes));
     fsbench::runShell("rm -rf '" + scratch + "'");
     return 0;
 }

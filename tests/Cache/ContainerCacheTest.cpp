@@ -9,6 +9,7 @@
 #include <stdexcept>
 
 #include "Cache/CacheTestSupport.h"
+#include "Daemon/CodeSigning/VSLWhitelist.h"
 #include "Daemon/Storage/VSLContainerCache.h"
 #include "Platform/SandboxState.h"
 #include "Platform/SystemRoot.h"
@@ -43,9 +44,6 @@ protected:
                 scans[transient ? key + "(transient)" : key]++;
             }
             if (willScan) willScan(key);
-        };
-        hooks.isWellKnownContainerName = [](VSLContainerClass c, const std::string& name) {
-            return c == 12 && name == "com.example.wellknown";
         };
         hooks.postUserInvalidatedNotification = [this] {
             notifications++;
@@ -217,10 +215,12 @@ TEST_F(ContainerCache, InconsistenciesAreReportedWithoutLosingAValidContainer) {
     EXPECT_EQ(1, scansOf(kAppData));
 }
 
-TEST_F(ContainerCache, SystemClassReadsWellKnownNamesAndFlaggedDamagedFiles) {
+TEST_F(ContainerCache, SystemClassReadsWellKnownNamesAndXMLFiles) {
+    auto names = VSLWhitelist::sharedWhitelist()->wellknownSystemContainers();
+    ASSERT_FALSE(names.empty());
     auto s = makeContainer(mobile, 12, "com.example.system");
-    auto wellKnown = makeContainer(mobile, 12, "com.example.wellknown");
-    std::string named = joinPath(classDirectory(mobile, 12), "com.example.wellknown");
+    auto wellKnown = makeContainer(mobile, 12, names[0]);
+    std::string named = joinPath(classDirectory(mobile, 12), names[0]);
     ASSERT_EQ(0, ::rename(wellKnown->url().c_str(), named.c_str()));
     auto other = makeContainer(mobile, 12, "com.example.other");
     ASSERT_EQ(0, ::rename(other->url().c_str(), joinPath(classDirectory(mobile, 12), "com.example.other").c_str()));
@@ -237,7 +237,7 @@ TEST_F(ContainerCache, SystemClassReadsWellKnownNamesAndFlaggedDamagedFiles) {
     auto all = cache->allContainersForUserIdentity(mobile, 12, false, &error);
     ASSERT_TRUE(all) << error->description();
     EXPECT_EQ((std::map<std::string, std::string>{{"com.example.system", s->url()},
-                                                  {"com.example.wellknown", named},
+                                                  {names[0], named},
                                                   {"com.example.xml", xmlDir}}),
               urlsByIdentifier(*all));
     EXPECT_EQ(1, scansOf("systemData"));

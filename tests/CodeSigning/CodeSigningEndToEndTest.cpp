@@ -40,20 +40,23 @@ std::string databasePath(const DaemonProcess& daemon) {
 
 TEST(CodeSigningEndToEnd, CommandsStoreReturnAndInvalidateCodeSigningInfo) {
     DaemonProcess daemon;
-    std::string installer = daemon.addClient("installer", "com.example.installer", dict({{kAllowed, Value::boolean(true)}}));
+    std::string installer =
+        daemon.addClient("installer", "com.example.installer", dict({{kAllowed, Value::boolean(true)}}));
     std::string stranger = daemon.addClient("stranger", "com.example.stranger", Value::dictionary({}));
     ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
 
-    Value info = dict({{"com.tarrow.Vesselry.Entitlements",
-                        dict({{"com.tarrow.security.application-groups", Value::array({Value::string("group.example")})}})},
-                       {"Version", Value::uint64(3)}});
+    Value info =
+        dict({{"com.tarrow.Vesselry.Entitlements",
+               dict({{"com.tarrow.security.application-groups", Value::array({Value::string("group.example")})}})},
+              {"Version", Value::uint64(3)}});
     std::string infoPath = plistFile(daemon, "info.plist", info);
-    std::string childOptions = plistFile(
-        daemon, "child-options.plist",
-        dict({{"com.tarrow.Vesselry.DataContainerClass", Value::uint64(4)},
-              {"com.tarrow.Vesselry.ParentBundleID", Value::string("com.example.app")}}));
+    std::string childOptions =
+        plistFile(daemon, "child-options.plist",
+                  dict({{"com.tarrow.Vesselry.DataContainerClass", Value::uint64(4)},
+                        {"com.tarrow.Vesselry.ParentBundleID", Value::string("com.example.app")}}));
 
-    auto r = daemon.run(installer, {"processCodeSigningInfo", "Identifier=com.example.app", "CodeSigningInfo=@" + infoPath});
+    auto r =
+        daemon.run(installer, {"processCodeSigningInfo", "Identifier=com.example.app", "CodeSigningInfo=@" + infoPath});
     ASSERT_EQ(1u, replyCode(r)) << r.err;
     r = daemon.run(installer, {"processCodeSigningInfo", "Identifier=com.example.app.widget",
                                "CodeSigningInfo=@" + infoPath, "OptionsDictionary=@" + childOptions});
@@ -74,8 +77,9 @@ TEST(CodeSigningEndToEnd, CommandsStoreReturnAndInvalidateCodeSigningInfo) {
     // Every entitled message registers its sender's own entitlements.
     r = daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.installer"});
     ASSERT_EQ(1u, replyCode(r));
-    EXPECT_TRUE(propertyListValuesEqual(dict({{"com.tarrow.Vesselry.Entitlements", dict({{kAllowed, Value::boolean(true)}})}}),
-                                        *r.reply.find("ReplyInfoDictionary")));
+    EXPECT_TRUE(
+        propertyListValuesEqual(dict({{"com.tarrow.Vesselry.Entitlements", dict({{kAllowed, Value::boolean(true)}})}}),
+                                *r.reply.find("ReplyInfoDictionary")));
 
     // No bundle container exists for anything registered here.
     r = daemon.run(installer, {"invalidateCodeSigningInfo"});
@@ -100,7 +104,8 @@ TEST(CodeSigningEndToEnd, CommandsStoreReturnAndInvalidateCodeSigningInfo) {
 
 TEST(CodeSigningEndToEnd, ACorruptDatabaseStopsTheDaemonUntilItIsMovedAside) {
     DaemonProcess daemon;
-    std::string installer = daemon.addClient("installer", "com.example.installer", dict({{kAllowed, Value::boolean(true)}}));
+    std::string installer =
+        daemon.addClient("installer", "com.example.installer", dict({{kAllowed, Value::boolean(true)}}));
     std::string path = databasePath(daemon);
     std::string mk = "mkdir -p '" + path.substr(0, path.rfind('/')) + "'";
     ASSERT_EQ(0, std::system(mk.c_str()));

@@ -16,7 +16,9 @@ Value strings(std::initializer_list<const char*> items) {
     return Value::array(std::move(a));
 }
 
-Value appGroups(Value groups) { return infoWithEntitlements(dict({{kVSLApplicationGroupsEntitlement, groups}})); }
+Value appGroups(Value groups) {
+    return infoWithEntitlements(dict({{kVSLApplicationGroupsEntitlement, groups}}));
+}
 
 bool drain(const std::shared_ptr<VSLCommandQueue>& queue, uint64_t* code = nullptr) {
     uint64_t c = kVSLSuccess;
@@ -33,7 +35,8 @@ TEST_F(CodeSigningTest, RegisteringTheSameInfoTwiceChangesNothingAndNoInfoRemove
     Value info = infoWithEntitlements(
         dict({{kVSLApplicationGroupsEntitlement, strings({"group.a"})}, {"com.example.level", Value::int64(3)}}),
         {{"Version", Value::int64(7)}});
-    Value options = dict({{kVSLOptionDataContainerClass, Value::uint64(2)}, {kVSLOptionPlaceholder, Value::boolean(true)}});
+    Value options =
+        dict({{kVSLOptionDataContainerClass, Value::uint64(2)}, {kVSLOptionPlaceholder, Value::boolean(true)}});
 
     EXPECT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(info, "com.example.app", options, queue));
     EXPECT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(info, "com.example.app", options, queue));
@@ -89,10 +92,10 @@ TEST_F(CodeSigningTest, AGroupNamedByTwoIdentifiersSurvivesOneAndIsStagedWhenThe
     auto onlyA = makeContainer(user, kVSLClassAppGroup, "group.only-a");
     auto queue = VSLCommandQueue::create();
     ASSERT_EQ(kVSLSuccess,
-              mapping_->processCodeSigningInfo(appGroups(strings({"group.shared", "group.only-a", "group.shared"})), "A",
-                                               std::nullopt, queue));
-    ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(appGroups(Value::string("group.shared")), "B",
-                                                            std::nullopt, queue));
+              mapping_->processCodeSigningInfo(appGroups(strings({"group.shared", "group.only-a", "group.shared"})),
+                                               "A", std::nullopt, queue));
+    ASSERT_EQ(kVSLSuccess,
+              mapping_->processCodeSigningInfo(appGroups(Value::string("group.shared")), "B", std::nullopt, queue));
     EXPECT_EQ(2u, mapping_->copyReferenceCountSetOfType(kVSLGroupTypeApplication)["group.shared"])
         << "A counts once although it names the group twice";
 
@@ -132,8 +135,8 @@ TEST_F(CodeSigningTest, GroupsAreStagedOnlyForUsersWithAHome) {
     makeMapping(identityCacheWithPersonas({personal, enterprise}));
 
     auto queue = VSLCommandQueue::create();
-    ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(appGroups(strings({"group.x", "group.y"})), "A",
-                                                            std::nullopt, queue));
+    ASSERT_EQ(kVSLSuccess,
+              mapping_->processCodeSigningInfo(appGroups(strings({"group.x", "group.y"})), "A", std::nullopt, queue));
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(appGroups(strings({"group.y"})), "A", std::nullopt, queue));
     EXPECT_EQ(1u, queue->pendingCount()) << "the personal user only: the enterprise home does not exist";
     EXPECT_TRUE(drain(queue)) << "a container not found does not fail the drain";
@@ -158,11 +161,13 @@ TEST_F(CodeSigningTest, SystemGroupsFollowThePrefixRuleAndAreNeverStagedIncremen
     Value primary = infoWithEntitlements(
         dict({{kVSLSystemGroupsEntitlement, strings({"systemgroup.com.example.one", "com.example.unprefixed"})}}));
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(primary, "S", std::nullopt, queue));
-    EXPECT_EQ(std::vector<std::string>{"systemgroup.com.example.one"}, mapping_->systemGroupIdentifiersForIdentifier("S"));
+    EXPECT_EQ(std::vector<std::string>{"systemgroup.com.example.one"},
+              mapping_->systemGroupIdentifiersForIdentifier("S"));
     EXPECT_LE(1u, log_.count("System group ID com.example.unprefixed does not have proper prefix, ignoring."));
 
-    Value fallback = infoWithEntitlements(dict({{kVSLSystemGroupsEntitlement, strings({})},
-                                                {kVSLSystemGroupContainersEntitlement, Value::string("systemgroup.b")}}));
+    Value fallback =
+        infoWithEntitlements(dict({{kVSLSystemGroupsEntitlement, strings({})},
+                                   {kVSLSystemGroupContainersEntitlement, Value::string("systemgroup.b")}}));
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(fallback, "T", std::nullopt, queue));
     EXPECT_EQ(std::vector<std::string>{"systemgroup.b"}, mapping_->systemGroupIdentifiersForIdentifier("T"));
     auto counts = mapping_->copyReferenceCountSetOfType(kVSLGroupTypeSystem);
@@ -178,8 +183,8 @@ TEST_F(CodeSigningTest, SystemGroupsFollowThePrefixRuleAndAreNeverStagedIncremen
     EXPECT_FALSE(mapping_->appGroupIdentifiersForIdentifier("N"));
     EXPECT_LE(1u, log_.count("Entitlement com.tarrow.security.application-groups for N does not contain supported "
                              "types; ignoring."));
-    Value mixed = infoWithEntitlements(dict({{kVSLApplicationGroupsEntitlement,
-                                              Value::array({Value::string("group.ok"), Value::uint64(1)})}}));
+    Value mixed = infoWithEntitlements(
+        dict({{kVSLApplicationGroupsEntitlement, Value::array({Value::string("group.ok"), Value::uint64(1)})}}));
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(mixed, "N", std::nullopt, queue));
     EXPECT_FALSE(mapping_->appGroupIdentifiersForIdentifier("N"));
 }
@@ -208,13 +213,13 @@ TEST_F(CodeSigningTest, ChildrenAttachOnlyToStoredParentsAndGoWithThem) {
 TEST_F(CodeSigningTest, ExternalReadsHideProvisionalEntriesAndCallerRegistrationYieldsToInstallers) {
     auto queue = VSLCommandQueue::create();
     Value ents = dict({{"com.example.flag", Value::boolean(true)}});
-    ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(
-                               infoWithEntitlements(ents), "com.example.placeholder",
-                               dict({{kVSLOptionPlaceholder, Value::boolean(true)}}), queue));
+    ASSERT_EQ(kVSLSuccess,
+              mapping_->processCodeSigningInfo(infoWithEntitlements(ents), "com.example.placeholder",
+                                               dict({{kVSLOptionPlaceholder, Value::boolean(true)}}), queue));
     EXPECT_FALSE(mapping_->getCodeSigningInfoForIdentifier("com.example.placeholder"));
     EXPECT_EQ(ents, mapping_->entitlementsForIdentifier("com.example.placeholder"));
-    ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(infoWithEntitlements(ents), "com.example.real",
-                                                            std::nullopt, queue));
+    ASSERT_EQ(kVSLSuccess,
+              mapping_->processCodeSigningInfo(infoWithEntitlements(ents), "com.example.real", std::nullopt, queue));
     EXPECT_EQ(infoWithEntitlements(ents), mapping_->getCodeSigningInfoForIdentifier("com.example.real"));
     ASSERT_TRUE(mapping_->invalidateCodeSigningInfoForIdentifier("com.example.real", nullptr));
     EXPECT_FALSE(mapping_->getCodeSigningInfoForIdentifier("com.example.real"));
@@ -241,15 +246,17 @@ TEST_F(CodeSigningTest, EntriesWithoutABundleContainerAreInvalidatedAndCachedInf
     auto queue = VSLCommandQueue::create();
     Value info = infoWithEntitlements(dict({}));
     auto reg = [&](const char* id, Value options = Value()) {
-        ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(
-                                   info, std::string(id), options.isNull() ? std::nullopt : std::optional(options), queue));
+        ASSERT_EQ(kVSLSuccess,
+                  mapping_->processCodeSigningInfo(info, std::string(id),
+                                                   options.isNull() ? std::nullopt : std::optional(options), queue));
     };
     reg("gone");
     reg("installed");
     makeContainer(user, kVSLClassApplication, "installed");
     reg("plugin.installed");
     makeContainer(user, kVSLClassPlugin, "plugin.installed");
-    reg("gone.ext", dict({{kVSLOptionDataContainerClass, Value::uint64(4)}, {kVSLOptionParentBundleID, Value::string("gone")}}));
+    reg("gone.ext",
+        dict({{kVSLOptionDataContainerClass, Value::uint64(4)}, {kVSLOptionParentBundleID, Value::string("gone")}}));
     reg("orphan.ext", dict({{kVSLOptionDataContainerClass, Value::uint64(4)}}));
     ASSERT_EQ(kVSLSuccess, mapping_->processCallerRegisteredEntitlements(dict({}), "self.registered", queue));
 

@@ -29,7 +29,9 @@ OSLogCapture::OSLogCapture() : lines_(std::make_shared<std::pair<std::mutex, std
     });
 }
 
-OSLogCapture::~OSLogCapture() { setOSLogSink({}); }
+OSLogCapture::~OSLogCapture() {
+    setOSLogSink({});
+}
 
 std::vector<std::string> OSLogCapture::messages() const {
     std::lock_guard g(lines_->first);
@@ -91,8 +93,8 @@ VSLMetadataRef makeContainer(const VSLUserIdentityRef& user, VSLContainerClass c
     std::string dir = joinPath(classDirectory.value_or(""), Uuid::random().string());
     EXPECT_EQ(0, ::mkdir(dir.c_str(), 0755)) << dir;
     uint64_t code = kVSLSuccess;
-    auto identity =
-        VSLConcreteContainerIdentity::containerIdentityWithUUID(Uuid::random(), user, identifier, containerClass, &code);
+    auto identity = VSLConcreteContainerIdentity::containerIdentityWithUUID(Uuid::random(), user, identifier,
+                                                                            containerClass, &code);
     EXPECT_TRUE(identity) << code;
     auto metadata = VSLMetadata::initWithContainerIdentity(identity, std::move(info), dir, std::nullopt);
     VSLErrorRef error;

@@ -35,13 +35,17 @@ public:
         auto c = column(sql);
         return c.empty() ? "<none>" : c[0];
     }
-    void exec(const std::string& sql) { EXPECT_EQ(SQLITE_OK, sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr)); }
+    void exec(const std::string& sql) {
+        EXPECT_EQ(SQLITE_OK, sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, nullptr));
+    }
 
 private:
     sqlite3* db_ = nullptr;
 };
 
-std::string databasePath(const std::string& dir) { return joinPath(dir, kVSLCodeSigningDatabaseFileName); }
+std::string databasePath(const std::string& dir) {
+    return joinPath(dir, kVSLCodeSigningDatabaseFileName);
+}
 
 VSLCodeSigningEntry entryWith(const std::string& marker, std::vector<std::string> children = {}) {
     auto entry = VSLCodeSigningEntry::initWithCodeSigningInfo(dict({{"marker", Value::string(marker)}}), 2);
@@ -49,7 +53,9 @@ VSLCodeSigningEntry entryWith(const std::string& marker, std::vector<std::string
     return entry;
 }
 
-bool isCode(const VSLErrorRef& e, uint64_t code) { return e && e->isVSLDomain() && uint64_t(e->code) == code; }
+bool isCode(const VSLErrorRef& e, uint64_t code) {
+    return e && e->isVSLDomain() && uint64_t(e->code) == code;
+}
 
 }  // namespace
 
@@ -64,13 +70,16 @@ TEST(VSLSQLiteDB, SchemaAndSettingsAreMadeOnFirstOpenAndTheFileReopensIntact) {
     }
     {
         RawDatabase raw(databasePath(dir));
-        EXPECT_EQ((std::vector<std::string>{"child_bundles", "code_signing_data", "code_signing_info"}),
-                  raw.column("SELECT name FROM sqlite_master WHERE type='table' AND name NOT LIKE 'sqlite_%' ORDER BY name"));
-        EXPECT_EQ((std::vector<std::string>{"code_signing_id_text_idx", "cs_info_id_idx", "parent_id_idx"}),
-                  raw.column("SELECT name FROM sqlite_master WHERE type='index' AND name NOT LIKE 'sqlite_%' ORDER BY name"));
+        EXPECT_EQ(
+            (std::vector<std::string>{"child_bundles", "code_signing_data", "code_signing_info"}),
+            raw.column("SELECT name FROM sqlite_master WHERE type='table' AND name NOT LIKE 'sqlite_%' ORDER BY name"));
+        EXPECT_EQ(
+            (std::vector<std::string>{"code_signing_id_text_idx", "cs_info_id_idx", "parent_id_idx"}),
+            raw.column("SELECT name FROM sqlite_master WHERE type='index' AND name NOT LIKE 'sqlite_%' ORDER BY name"));
         EXPECT_EQ("wal", raw.one("PRAGMA journal_mode"));
         EXPECT_EQ("1", raw.one("PRAGMA auto_vacuum")) << "full auto-vacuum";
-        EXPECT_EQ("1", raw.one("SELECT count(*) FROM pragma_foreign_key_list('child_bundles') WHERE \"table\"='code_signing_info' AND on_delete='CASCADE'"));
+        EXPECT_EQ("1", raw.one("SELECT count(*) FROM pragma_foreign_key_list('child_bundles') WHERE "
+                               "\"table\"='code_signing_info' AND on_delete='CASCADE'"));
     }
     auto db = VSLSQLiteDB::initWithParentDirectoryURL(dir);
     ASSERT_TRUE(db);
@@ -136,7 +145,8 @@ TEST(VSLSQLiteDB, RowsUpdateInPlaceChildrenAccumulateAndMoveBetweenParents) {
         ASSERT_TRUE(x);
         EXPECT_EQ("v2", *x->codeSigningInfo->find("marker")->stringValue());
         EXPECT_TRUE(x->invalid && x->registeredByCaller);
-        EXPECT_EQ((std::vector<std::string>{"c1", "c2"}), x->childBundleIdentifiers) << "dropped children keep their rows";
+        EXPECT_EQ((std::vector<std::string>{"c1", "c2"}), x->childBundleIdentifiers)
+            << "dropped children keep their rows";
 
         auto z = entryWith("z", {"c1"});
         ASSERT_TRUE(db->addCodeSigningEntry(&z, std::string("Z"), nullptr));
@@ -182,9 +192,13 @@ TEST(VSLSQLiteDB, DeletionCascadesInvalidationReachesChildrenAndAdvanceCopiesAre
         EXPECT_FALSE(db->deleteCodeSigningEntryWithIdentifier(std::string("P"), &error));
         EXPECT_TRUE(isCode(error, kVSLErrorDatabase)) << "deleting what is not stored fails";
 
-        struct Flags { const char* id; bool placeholder; bool advanceCopy; };
-        for (Flags f : {Flags{"placeholderOnly", true, false}, Flags{"advanceOnly", false, true},
-                        Flags{"both", true, true}}) {
+        struct Flags {
+            const char* id;
+            bool placeholder;
+            bool advanceCopy;
+        };
+        for (Flags f :
+             {Flags{"placeholderOnly", true, false}, Flags{"advanceOnly", false, true}, Flags{"both", true, true}}) {
             auto e = entryWith(f.id);
             e.placeholder = f.placeholder;
             e.advanceCopy = f.advanceCopy;
@@ -197,7 +211,9 @@ TEST(VSLSQLiteDB, DeletionCascadesInvalidationReachesChildrenAndAdvanceCopiesAre
         EXPECT_EQ((std::set<std::string>{"kid", "placeholderOnly"}), db->identifiersWithError(nullptr));
     }
     RawDatabase raw(databasePath(dir));
-    EXPECT_EQ("0", raw.one("SELECT count(*) FROM code_signing_data WHERE cs_info_id NOT IN (SELECT id FROM code_signing_info)"));
+    EXPECT_EQ(
+        "0",
+        raw.one("SELECT count(*) FROM code_signing_data WHERE cs_info_id NOT IN (SELECT id FROM code_signing_info)"));
     EXPECT_EQ("1", raw.one("SELECT placeholder FROM code_signing_info WHERE code_signing_id_text='placeholderOnly'"));
 }
 
@@ -217,13 +233,21 @@ TEST(VSLSQLiteDB, ARowWithoutDataIsNotFoundAndEnumerationSkipsIt) {
     EXPECT_FALSE(db->codeSigningEntryWithIdentifier("bare", &error));
     EXPECT_TRUE(isCode(error, kVSLErrorNotInDatabase));
     EXPECT_EQ((std::set<std::string>{"A", "bare"}), db->identifiersWithError(nullptr));
+    auto b = entryWith("b");
+    ASSERT_TRUE(db->addCodeSigningEntry(&b, std::string("B"), nullptr));
+    // The same query again while the first is still stepping gets a statement of its own.
     std::vector<std::string> seen;
     EXPECT_FALSE(db->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
         [&](const std::string& id, const VSLCodeSigningEntry& entry) {
             seen.push_back(id);
-            EXPECT_EQ((std::vector<std::string>{"a.kid"}), entry.childBundleIdentifiers);
+            EXPECT_EQ(id == "A" ? std::optional(std::vector<std::string>{"a.kid"}) : std::nullopt,
+                      entry.childBundleIdentifiers);
+            size_t inner = 0;
+            EXPECT_FALSE(db->enumerateIdentifiersAndCodeSigningInfoUsingBlock(
+                [&](const std::string&, const VSLCodeSigningEntry&) { inner++; }));
+            EXPECT_EQ(2u, inner);
         }));
-    EXPECT_EQ(std::vector<std::string>{"A"}, seen);
+    EXPECT_EQ((std::vector<std::string>{"A", "B"}), seen);
 }
 
 TEST(VSLSQLiteDBDeathTest, AFileThatCannotBeUsedEndsTheProcessWithTheCrashMessage) {

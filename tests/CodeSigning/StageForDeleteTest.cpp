@@ -40,9 +40,9 @@ TEST_F(CodeSigningTest, StagingABundleRemovesItsRecordsUnlessOnlyATransientCopyG
     auto queue = VSLCommandQueue::create();
     Value info = infoWithEntitlements(dict({}));
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(info, "com.example.app", std::nullopt, queue));
-    ASSERT_EQ(kVSLSuccess,
-              mapping_->processCodeSigningInfo(info, "com.example.app.widget",
-                                               dict({{kVSLOptionParentBundleID, Value::string("com.example.app")}}), queue));
+    ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(
+                               info, "com.example.app.widget",
+                               dict({{kVSLOptionParentBundleID, Value::string("com.example.app")}}), queue));
     ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(info, "com.example.updating", std::nullopt, queue));
     auto app = makeContainer(user, kVSLClassApplication, "com.example.app");
     auto permanent = makeContainer(user, kVSLClassApplication, "com.example.updating");

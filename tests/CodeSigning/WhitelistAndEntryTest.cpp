@@ -21,8 +21,8 @@ TEST(VSLWhitelist, LookupPermissionFollowsContainerThenCallerThenClass) {
             everything++;
             for (VSLContainerClass c = 0; c < kVSLClassMax; c++)
                 EXPECT_TRUE(whitelist->isLookupWhitelistedFromCodeSignIdentifier(row.codeSigningIdentifier, c, "x.y"));
-            EXPECT_FALSE(whitelist->isLookupWhitelistedFromCodeSignIdentifier(row.codeSigningIdentifier, kVSLClassMax,
-                                                                              "x.y"));
+            EXPECT_FALSE(
+                whitelist->isLookupWhitelistedFromCodeSignIdentifier(row.codeSigningIdentifier, kVSLClassMax, "x.y"));
             continue;
         }
         oneClass++;
@@ -30,7 +30,8 @@ TEST(VSLWhitelist, LookupPermissionFollowsContainerThenCallerThenClass) {
                                                                          row.containerIdentifier));
         EXPECT_FALSE(whitelist->isLookupWhitelistedFromCodeSignIdentifier(row.codeSigningIdentifier, row.containerClass,
                                                                           "com.example.other"));
-        VSLContainerClass otherClass = row.containerClass == kVSLClassAppGroup ? kVSLClassApplicationData : kVSLClassAppGroup;
+        VSLContainerClass otherClass =
+            row.containerClass == kVSLClassAppGroup ? kVSLClassApplicationData : kVSLClassAppGroup;
         EXPECT_FALSE(whitelist->isLookupWhitelistedFromCodeSignIdentifier(row.codeSigningIdentifier, otherClass,
                                                                           row.containerIdentifier));
     }

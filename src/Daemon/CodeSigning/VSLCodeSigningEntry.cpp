@@ -19,7 +19,9 @@ const char* const kAdvanceCopyKey = "AdvanceCopy";
 const char* const kRegisteredByCallerKey = "RegisteredByCaller";
 const char* const kDataContainerClassKey = "DataContainerClass";
 
-bool flag(const Value& dictionary, const char* key) { return propertyListTruthValue(dictionary.find(key)); }
+bool flag(const Value& dictionary, const char* key) {
+    return propertyListTruthValue(dictionary.find(key));
+}
 
 }  // namespace
 

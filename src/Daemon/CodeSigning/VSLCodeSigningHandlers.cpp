@@ -23,10 +23,9 @@ void processCodeSigningInfoCommand(const Value& request, const VSLReplyRef&, con
         *code = kVSLErrorDatabase;
         return;
     }
-    uint64_t result = mapping->processCodeSigningInfo(dictionaryFromRequest(request, "CodeSigningInfo"),
-                                                      stringFromRequest(request, "Identifier"),
-                                                      dictionaryFromRequest(request, "OptionsDictionary"),
-                                                      connection->commandQueue());
+    uint64_t result = mapping->processCodeSigningInfo(
+        dictionaryFromRequest(request, "CodeSigningInfo"), stringFromRequest(request, "Identifier"),
+        dictionaryFromRequest(request, "OptionsDictionary"), connection->commandQueue());
     if (result != kVSLSuccess) *code = result;
 }
 
@@ -46,8 +45,7 @@ void getCodeSigningInfoCommand(const Value& request, const VSLReplyRef& reply, c
     reply->set("ReplyInfoDictionary", *info);
 }
 
-void invalidateCodeSigningInfoCommand(const Value&, const VSLReplyRef&, const VSLClientConnectionRef&,
-                                      uint64_t* code) {
+void invalidateCodeSigningInfoCommand(const Value&, const VSLReplyRef&, const VSLClientConnectionRef&, uint64_t* code) {
     auto mapping = VSLCodeSigningMapping::sharedInstance();
     if (!mapping) {
         *code = kVSLErrorDatabase;

@@ -15,8 +15,8 @@ namespace vsl {
 void processCodeSigningInfoCommand(const Value& request, const VSLReplyRef& reply,
                                    const VSLClientConnectionRef& connection, uint64_t* code);
 // "Identifier" -> "ReplyInfoDictionary"; code 21 when there is nothing to give.
-void getCodeSigningInfoCommand(const Value& request, const VSLReplyRef& reply,
-                               const VSLClientConnectionRef& connection, uint64_t* code);
+void getCodeSigningInfoCommand(const Value& request, const VSLReplyRef& reply, const VSLClientConnectionRef& connection,
+                               uint64_t* code);
 // Invalidates entries whose bundle container is gone; the code is the result.
 void invalidateCodeSigningInfoCommand(const Value& request, const VSLReplyRef& reply,
                                       const VSLClientConnectionRef& connection, uint64_t* code);

@@ -34,18 +34,18 @@ namespace vsl {
 class VSLUserIdentityCache;
 
 // Entitlement keys read from an identifier's entitlements.
-extern const char* const kVSLApplicationGroupsEntitlement;         // "com.tarrow.security.application-groups"
-extern const char* const kVSLSystemGroupsEntitlement;              // "com.tarrow.security.system-groups"
-extern const char* const kVSLSystemGroupContainersEntitlement;     // "com.tarrow.security.system-group-containers"
-extern const char* const kVSLSystemContainerEntitlement;           // "com.tarrow.security.system-container"
+extern const char* const kVSLApplicationGroupsEntitlement;      // "com.tarrow.security.application-groups"
+extern const char* const kVSLSystemGroupsEntitlement;           // "com.tarrow.security.system-groups"
+extern const char* const kVSLSystemGroupContainersEntitlement;  // "com.tarrow.security.system-group-containers"
+extern const char* const kVSLSystemContainerEntitlement;        // "com.tarrow.security.system-container"
 // Keys of the options of processCodeSigningInfo.
-extern const char* const kVSLOptionDataContainerClass;    // "com.tarrow.Vesselry.DataContainerClass"
-extern const char* const kVSLOptionParentBundleID;        // "com.tarrow.Vesselry.ParentBundleID"
-extern const char* const kVSLOptionRegisteredByCaller;    // "RegByCaller"
-extern const char* const kVSLOptionPlaceholder;           // "com.tarrow.Vesselry.PlaceholderEntitlements"
-extern const char* const kVSLOptionAdvanceCopy;           // "com.tarrow.Vesselry.AdvanceCopy"
+extern const char* const kVSLOptionDataContainerClass;  // "com.tarrow.Vesselry.DataContainerClass"
+extern const char* const kVSLOptionParentBundleID;      // "com.tarrow.Vesselry.ParentBundleID"
+extern const char* const kVSLOptionRegisteredByCaller;  // "RegByCaller"
+extern const char* const kVSLOptionPlaceholder;         // "com.tarrow.Vesselry.PlaceholderEntitlements"
+extern const char* const kVSLOptionAdvanceCopy;         // "com.tarrow.Vesselry.AdvanceCopy"
 // The code-signing information a bundle container's metadata caches.
-extern const char* const kVSLCachedCodeSigningInfoKey;    // "com.tarrow.Stowage.CachedCodeSigningInfo"
+extern const char* const kVSLCachedCodeSigningInfoKey;  // "com.tarrow.Stowage.CachedCodeSigningInfo"
 
 // Group types: application groups (class 7) and system groups (class 13).
 enum VSLGroupType : int64_t { kVSLGroupTypeApplication = 0, kVSLGroupTypeSystem = 1 };
@@ -75,8 +75,7 @@ public:
     // Registers, replaces or (with no info) removes an identifier's entry; stages
     // what the change makes obsolete on `commandQueue`. Returns a result code.
     uint64_t processCodeSigningInfo(const std::optional<Value>& codeSigningInfo,
-                                    const std::optional<std::string>& identifier,
-                                    const std::optional<Value>& options,
+                                    const std::optional<std::string>& identifier, const std::optional<Value>& options,
                                     const std::shared_ptr<VSLCommandQueue>& commandQueue);
     // A running client's own entitlements; installer-registered information wins.
     // An empty identifier counts as missing.
@@ -100,8 +99,7 @@ public:
     bool identifierHasCallerRegisteredEntitlements(const std::string& identifier);
     std::optional<std::vector<std::string>> childBundleIdentifiersForParentIdentifier(const std::string& identifier);
     std::optional<std::string> parentIdentifierForChildIdentifier(const std::string& identifier);
-    std::optional<VSLCodeSigningEntry> codeSigningEntryForIdentifier(const std::string& identifier,
-                                                                     VSLErrorRef* error);
+    std::optional<VSLCodeSigningEntry> codeSigningEntryForIdentifier(const std::string& identifier, VSLErrorRef* error);
     std::optional<std::set<std::string>> identifiersWithError(VSLErrorRef* error);
 
     // ---- maintenance ----

@@ -37,8 +37,8 @@ std::optional<std::vector<std::string>> VSLCodeSigningMapping::_copyApplicationG
         supported = false;
     }
     if (!supported) {
-        osLog(LogCategory::CodeSignMapping, OSLogLevel::Error, "Entitlement %@ for %@ does not contain supported types; ignoring.",
-              groupKey, identifier);
+        osLog(LogCategory::CodeSignMapping, OSLogLevel::Error,
+              "Entitlement %@ for %@ does not contain supported types; ignoring.", groupKey, identifier);
         return std::nullopt;
     }
     std::set<std::string> seen;
@@ -60,8 +60,8 @@ std::optional<std::vector<std::string>> VSLCodeSigningMapping::_systemGroupIdent
         if (g.rfind(kSystemGroupPrefix, 0) == 0) {
             accepted.push_back(std::move(g));
         } else {
-            osLog(LogCategory::CodeSignMapping, OSLogLevel::Error, "System group ID %@ does not have proper prefix, ignoring.",
-                  g);
+            osLog(LogCategory::CodeSignMapping, OSLogLevel::Error,
+                  "System group ID %@ does not have proper prefix, ignoring.", g);
         }
     }
     return accepted;
@@ -93,13 +93,12 @@ VSLCountedSet VSLCodeSigningMapping::_onQueue_copyReferenceCountSetOfType(VSLGro
     VSLCountedSet counts;
     const char* key = type == kVSLGroupTypeSystem ? kVSLSystemGroupsEntitlement : kVSLApplicationGroupsEntitlement;
     const char* fallBackKey = type == kVSLGroupTypeSystem ? kVSLSystemGroupContainersEntitlement : nullptr;
-    _onQueue_iterateGroupIdsWithKey(key, fallBackKey,
-                                    [&](const std::string& identifier, const std::vector<std::string>& groups) {
-                                        osLog(LogCategory::CodeSignMapping, OSLogLevel::Debug,
-                                              "Entitlements for identifier %@ references container IDs: %@",
-                                              identifier, stringListValue(groups));
-                                        for (const auto& g : groups) counts[g]++;
-                                    });
+    _onQueue_iterateGroupIdsWithKey(
+        key, fallBackKey, [&](const std::string& identifier, const std::vector<std::string>& groups) {
+            osLog(LogCategory::CodeSignMapping, OSLogLevel::Debug,
+                  "Entitlements for identifier %@ references container IDs: %@", identifier, stringListValue(groups));
+            for (const auto& g : groups) counts[g]++;
+        });
     return counts;
 }
 
@@ -138,16 +137,17 @@ void VSLCodeSigningMapping::_onQueue_removeReferenceForGroupIdentifiers(
 }
 
 void VSLCodeSigningMapping::_onQueue_removeGroupContainersIfNeededforUserIdentity(
-    const VSLUserIdentityRef& userIdentity, uint64_t groupContainerClass, const std::vector<std::string>& groupIdentifiers,
-    VSLCountedSet referenceCounts, const std::shared_ptr<VSLCommandQueue>& commandQueue) {
+    const VSLUserIdentityRef& userIdentity, uint64_t groupContainerClass,
+    const std::vector<std::string>& groupIdentifiers, VSLCountedSet referenceCounts,
+    const std::shared_ptr<VSLCommandQueue>& commandQueue) {
     assertOnQueue();
     for (const auto& group : groupIdentifiers) {
         uint64_t& count = referenceCounts[group];
         if (count == 1) {
             // The identifier being changed is the only one that names it.
             uint64_t code = kVSLSuccess;
-            auto identity =
-                VSLContainerIdentity::containerIdentityWithUserIdentity(userIdentity, group, groupContainerClass, &code);
+            auto identity = VSLContainerIdentity::containerIdentityWithUserIdentity(userIdentity, group,
+                                                                                    groupContainerClass, &code);
             if (identity && commandQueue) {
                 commandQueue->insertCommand(VSLCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
                     {identity}, true, [group, userIdentity](uint64_t failure) {

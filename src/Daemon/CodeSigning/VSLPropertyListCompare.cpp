@@ -10,7 +10,9 @@ namespace vsl {
 
 namespace {
 
-bool isInteger(const Value& v) { return v.type() == Value::Type::UInt64 || v.type() == Value::Type::Int64; }
+bool isInteger(const Value& v) {
+    return v.type() == Value::Type::UInt64 || v.type() == Value::Type::Int64;
+}
 
 bool integersEqual(const Value& a, const Value& b) {
     if (a.type() == b.type()) return a == b;
@@ -38,7 +40,9 @@ bool uuidBytes(const Value& v, Uuid* out) {
     return true;
 }
 
-size_t mix(size_t seed, size_t h) { return seed ^ (h + 0x9e3779b97f4a7c15ULL + (seed << 6) + (seed >> 2)); }
+size_t mix(size_t seed, size_t h) {
+    return seed ^ (h + 0x9e3779b97f4a7c15ULL + (seed << 6) + (seed >> 2));
+}
 
 }  // namespace
 
@@ -71,8 +75,10 @@ bool propertyListValuesEqual(const Value& a, const Value& b) {
 
 size_t propertyListHash(const Value& v) {
     switch (v.type()) {
-        case Value::Type::UInt64: return std::hash<uint64_t>()(*v.uint64Value());
-        case Value::Type::Int64: return std::hash<uint64_t>()(static_cast<uint64_t>(*v.int64Value()));
+        case Value::Type::UInt64:
+            return std::hash<uint64_t>()(*v.uint64Value());
+        case Value::Type::Int64:
+            return std::hash<uint64_t>()(static_cast<uint64_t>(*v.int64Value()));
         case Value::Type::Double: {
             double d = *v.doubleValue();
             // Integral doubles hash as the integer they equal.
@@ -81,15 +87,16 @@ size_t propertyListHash(const Value& v) {
                              : std::hash<uint64_t>()(static_cast<uint64_t>(d));
             return std::hash<double>()(d);
         }
-        case Value::Type::Uuid: return v.uuidValue()->hash();
+        case Value::Type::Uuid:
+            return v.uuidValue()->hash();
         case Value::Type::Data: {
             Uuid u;
             if (uuidBytes(v, &u)) return u.hash();
             const Data& d = *v.dataValue();
-            return std::hash<std::string_view>()(
-                std::string_view(reinterpret_cast<const char*>(d.data()), d.size()));
+            return std::hash<std::string_view>()(std::string_view(reinterpret_cast<const char*>(d.data()), d.size()));
         }
-        case Value::Type::String: return std::hash<std::string>()(*v.stringValue());
+        case Value::Type::String:
+            return std::hash<std::string>()(*v.stringValue());
         case Value::Type::Array: {
             size_t h = 0xA;
             for (const auto& item : *v.arrayValue()) h = mix(h, propertyListHash(item));
@@ -101,9 +108,12 @@ size_t propertyListHash(const Value& v) {
                 h = mix(mix(h, std::hash<std::string>()(k)), propertyListHash(item));
             return h;
         }
-        case Value::Type::Bool: return *v.boolValue() ? 0xB1 : 0xB0;
-        case Value::Type::Date: return std::hash<int64_t>()(v.dateValue()->nanoseconds);
-        case Value::Type::Null: return 0;
+        case Value::Type::Bool:
+            return *v.boolValue() ? 0xB1 : 0xB0;
+        case Value::Type::Date:
+            return std::hash<int64_t>()(v.dateValue()->nanoseconds);
+        case Value::Type::Null:
+            return 0;
     }
     return 0;
 }

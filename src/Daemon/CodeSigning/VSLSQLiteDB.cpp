@@ -58,42 +58,7 @@ const char* const kInsertChild =
     "code_signing_info WHERE code_signing_id_text = ?;";
 const char* const kDelete = "DELETE FROM code_signing_info WHERE code_signing_id_text=?;";
 const char* const kInvalidate = "UPDATE code_signing_info SET invalid=1 WHERE code_signing_id_text = ?;";
-const char* const kSelectOne =
-    "SELECT code_signing_data.data, code_signing_info.invalid, code_signing_info.placeholder, "
-    "code_signing_info.registered_by_caller, code_signing_info.data_container_class FROM code_signing_info, "
-    "code_signing_data WHERE code_signing_info.id = code_signing_data.cs_info_id AND "
-    "code_signing_info.code_signing_id_text = ?;";
-const char* const kSelectAll =
-    "SELECT code_signing_data.data, code_signing_info.invalid, code_signing_info.placeholder, "
-    "code_signing_info.registered_by_caller, code_signing_info.data_container_class, "
-    "code_signing_info.code_signing_id_text FROM code_signing_info, code_signing_data WHERE code_signing_info.id = "
-    "code_signing_data.cs_info_id;";
-const char* const kSelectIdentifiers = "SELECT code_signing_info.code_signing_id_text FROM code_signing_info;";
-const char* const kSelectChildren =
-    "SELECT child_bundles.child_code_signing_id_text FROM child_bundles, code_signing_info WHERE "
-    "code_signing_info.code_signing_id_text = ? AND child_bundles.parent_id=code_signing_info.id;";
-const char* const kSelectParent =
-    "SELECT code_signing_info.code_signing_id_text FROM child_bundles, code_signing_info WHERE "
-    "child_bundles.child_code_signing_id_text = ? AND child_bundles.parent_id=code_signing_info.id;";
 const char* const kDeleteAdvanceCopies = "DELETE FROM code_signing_info WHERE (placeholder & ?) > 0;";
-
-constexpr int kFlagPlaceholder = 1;
-constexpr int kFlagAdvanceCopy = 2;
-
-bool fail(VSLErrorRef* out, VSLErrorRef error) {
-    if (out) *out = std::move(error);
-    return false;
-}
-
-bool isVSLCode(const VSLErrorRef& e, uint64_t code) {
-    return e && e->isVSLDomain() && static_cast<uint64_t>(e->code) == code;
-}
-
-std::optional<std::string> columnText(sqlite3_stmt* statement, int column) {
-    const unsigned char* text = sqlite3_column_text(statement, column);
-    if (!text) return std::nullopt;
-    return std::string(reinterpret_cast<const char*>(text), static_cast<size_t>(sqlite3_column_bytes(statement, column)));
-}
 
 }  // namespace
 
@@ -117,7 +82,8 @@ sqlite3* VSLSQLiteDB::openDBWithURL(const std::string& url) {
     sqlite3* db = nullptr;
     int rc = sqlite3_open_v2(url.c_str(), &db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
     if (rc != SQLITE_OK) {
-        LogWrite(kLogLevelError, "openDBWithURL", "opening %@ failed: %s", url, db ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
+        LogWrite(kLogLevelError, "openDBWithURL", "opening %@ failed: %s", url,
+                 db ? sqlite3_errmsg(db) : sqlite3_errstr(rc));
         sqlite3_close(db);
         LogWrite(kLogLevelError, "openDBWithURL",
                  "The code-signing database %@ cannot be used. Move it aside and restart vesseld; it starts with an "
@@ -141,13 +107,17 @@ sqlite3* VSLSQLiteDB::openDBWithURL(const std::string& url) {
     return db;
 }
 
-VSLSQLiteDB::VSLSQLiteDB(Passkey, sqlite3* db, std::string url) : db_(db), url_(std::move(url)) {}
+VSLSQLiteDB::VSLSQLiteDB(Passkey, sqlite3* db, std::string url)
+    : db_(db), url_(std::move(url)), statements_(std::make_unique<VSLSQLiteStatementCache>(db_, url_)) {}
 
-VSLSQLiteDB::~VSLSQLiteDB() { closeDB(); }
+VSLSQLiteDB::~VSLSQLiteDB() {
+    closeDB();
+}
 
 void VSLSQLiteDB::closeDB() {
     if (!db_) return;
     osLog(LogCategory::Database, OSLogLevel::Debug, "closing %@", url_);
+    statements_->finalizeAll();
     int rc = sqlite3_close(db_);
     if (rc != SQLITE_OK) LogWrite(kLogLevelError, "closeDB", "sqlite3_close for %@ failed: %d", url_, rc);
     db_ = nullptr;
@@ -158,20 +128,20 @@ bool VSLSQLiteDB::_sqliteExec(const char* sql, VSLErrorRef* error) {
     if (sqlite3_exec(db_, sql, nullptr, nullptr, &message) == SQLITE_OK) return true;
     auto e = VSL_ERROR(kVSLErrorDatabase, nullptr, true, "%@ on %@ failed: %s", sql, url_, message ? message : "");
     sqlite3_free(message);
-    return fail(error, e);
+    return failWithError(error, e);
 }
 
 bool VSLSQLiteDB::_rollback(VSLErrorRef* error) {
     VSLErrorRef underlying;
     if (_sqliteExec("ROLLBACK;", &underlying)) return true;
-    return fail(error, VSL_ERROR(kVSLErrorDatabase, underlying, true, "failed _sqliteExec rollback"));
+    return failWithError(error, VSL_ERROR(kVSLErrorDatabase, underlying, true, "failed _sqliteExec rollback"));
 }
 
 // ---- writing ----
 
 bool VSLSQLiteDB::_performInsertOrUpdateQuery(const char* sql, const VSLCodeSigningEntry& entry,
                                               const std::string& identifier, bool isUpdate, VSLErrorRef* error) {
-    VSLSQLiteStatement statement(db_, url_);
+    VSLSQLiteStatement statement(*statements_);
     if (!statement.prepare(sql, "insert", error)) return false;
     sqlite3_stmt* s = statement.get();
     int invalid = entry.invalid ? 1 : 0;
@@ -180,28 +150,31 @@ bool VSLSQLiteDB::_performInsertOrUpdateQuery(const char* sql, const VSLCodeSign
     int flags = (entry.placeholder ? kFlagPlaceholder : 0) | (entry.advanceCopy ? kFlagAdvanceCopy : 0);
     int registeredByCaller = entry.registeredByCaller ? 1 : 0;
     if (sqlite3_bind_int(s, 1, invalid) != SQLITE_OK)
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true, "sqlite3_bind_int for invalid=%d at %@ failed: %s",
-                                     invalid, url_, sqlite3_errmsg(db_)));
+        return failWithError(
+            error, VSL_ERROR(kVSLErrorDatabase, nullptr, true, "sqlite3_bind_int for invalid=%d at %@ failed: %s",
+                             invalid, url_, sqlite3_errmsg(db_)));
     if (sqlite3_bind_int(s, 2, flags) != SQLITE_OK)
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
-                                     "sqlite3_bind_int for placeholder=%d, advance_copy=%d (flags=%d) at %@ failed: %s",
-                                     placeholder, advanceCopy, flags, url_, sqlite3_errmsg(db_)));
+        return failWithError(
+            error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
+                             "sqlite3_bind_int for placeholder=%d, advance_copy=%d (flags=%d) at %@ failed: %s",
+                             placeholder, advanceCopy, flags, url_, sqlite3_errmsg(db_)));
     if (sqlite3_bind_int(s, 3, registeredByCaller) != SQLITE_OK)
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
-                                     "sqlite3_bind_int for registered_by_caller=%d at %@ failed: %s",
-                                     registeredByCaller, url_, sqlite3_errmsg(db_)));
+        return failWithError(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
+                                              "sqlite3_bind_int for registered_by_caller=%d at %@ failed: %s",
+                                              registeredByCaller, url_, sqlite3_errmsg(db_)));
     if (sqlite3_bind_int(s, 4, static_cast<int>(entry.dataContainerClass)) != SQLITE_OK)
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
-                                     "sqlite3_bind_int for data_container_class=%llu at %@ failed: %s",
-                                     entry.dataContainerClass, url_, sqlite3_errmsg(db_)));
+        return failWithError(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
+                                              "sqlite3_bind_int for data_container_class=%llu at %@ failed: %s",
+                                              entry.dataContainerClass, url_, sqlite3_errmsg(db_)));
     if (!statement.bindText(5, identifier, "sqlite3_bind_text for code_signing_id_text=%@ at %@ failed: %s", error))
         return false;
     if (!statement.stepToDone(error)) return false;
     if (isUpdate) {
         int changes = sqlite3_changes(db_);
         if (changes != 1)
-            return fail(error, VSL_ERROR(kVSLErrorDatabaseChanges, nullptr, false,
-                                         "sqlite3_changes for %s in %@: %d, but expecting 1", sql, url_, changes));
+            return failWithError(error,
+                                 VSL_ERROR(kVSLErrorDatabaseChanges, nullptr, false,
+                                           "sqlite3_changes for %s in %@: %d, but expecting 1", sql, url_, changes));
     }
     return true;
 }
@@ -210,13 +183,13 @@ bool VSLSQLiteDB::_insertCodeSigningInfo(const VSLCodeSigningEntry& entry, const
                                          VSLErrorRef* error) {
     VSLErrorRef updateError;
     if (_performInsertOrUpdateQuery(kUpdateInfo, entry, identifier, true, &updateError)) return true;
-    if (!isVSLCode(updateError, kVSLErrorDatabaseChanges))
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, updateError, true, "Error performing UPDATE operation for %@",
-                                     identifier));
+    if (!isErrorCode(updateError, kVSLErrorDatabaseChanges))
+        return failWithError(error, VSL_ERROR(kVSLErrorDatabase, updateError, true,
+                                              "Error performing UPDATE operation for %@", identifier));
     VSLErrorRef insertError;
     if (_performInsertOrUpdateQuery(kInsertInfo, entry, identifier, false, &insertError)) return true;
-    return fail(error, VSL_ERROR(kVSLErrorDatabase, insertError, true, "Error performing INSERT operation for %@",
-                                 identifier));
+    return failWithError(
+        error, VSL_ERROR(kVSLErrorDatabase, insertError, true, "Error performing INSERT operation for %@", identifier));
 }
 
 bool VSLSQLiteDB::_insertCodeSigningData(const VSLCodeSigningEntry& entry, const std::string& identifier,
@@ -225,14 +198,14 @@ bool VSLSQLiteDB::_insertCodeSigningData(const VSLCodeSigningEntry& entry, const
     std::optional<std::string> blob;
     if (entry.codeSigningInfo) blob = encodeBinaryPropertyList(*entry.codeSigningInfo, &why);
     if (!blob)
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true, "Error creating NSData from code signing info: %@",
-                                     why));
-    VSLSQLiteStatement statement(db_, url_);
+        return failWithError(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
+                                              "Error creating NSData from code signing info: %@", why));
+    VSLSQLiteStatement statement(*statements_);
     if (!statement.prepare(kInsertData, "insert", error)) return false;
     if (sqlite3_bind_blob64(statement.get(), 1, blob->data(), blob->size(), SQLITE_STATIC) != SQLITE_OK)
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
-                                     "sqlite3_bind_blob64 for codeSigningInfoData at %@ failed: %s", url_,
-                                     sqlite3_errmsg(db_)));
+        return failWithError(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
+                                              "sqlite3_bind_blob64 for codeSigningInfoData at %@ failed: %s", url_,
+                                              sqlite3_errmsg(db_)));
     if (!statement.bindText(2, identifier, "sqlite3_bind_text for code_signing_id=%@ at %@ failed: %s", error))
         return false;
     return statement.stepToDone(error);
@@ -241,7 +214,7 @@ bool VSLSQLiteDB::_insertCodeSigningData(const VSLCodeSigningEntry& entry, const
 bool VSLSQLiteDB::_performTwoParameterQuery(const char* sql, const char* kind, const std::string& textOne,
                                             const char* textOneFailureFormat, const std::string* textTwo,
                                             int expectedChanges, VSLErrorRef* error) {
-    VSLSQLiteStatement statement(db_, url_);
+    VSLSQLiteStatement statement(*statements_);
     if (!statement.prepare(sql, kind, error)) return false;
     if (!statement.bindText(1, textOne, textOneFailureFormat, error)) return false;
     if (textTwo &&
@@ -251,9 +224,9 @@ bool VSLSQLiteDB::_performTwoParameterQuery(const char* sql, const char* kind, c
     if (expectedChanges != -1) {
         int changes = sqlite3_changes(db_);
         if (changes != expectedChanges)
-            return fail(error, VSL_ERROR(kVSLErrorDatabaseChanges, nullptr, false,
-                                         "sqlite3_changes for %s in %@: %d, but expecting %d", sql, url_, changes,
-                                         expectedChanges));
+            return failWithError(error, VSL_ERROR(kVSLErrorDatabaseChanges, nullptr, false,
+                                                  "sqlite3_changes for %s in %@: %d, but expecting %d", sql, url_,
+                                                  changes, expectedChanges));
     }
     return true;
 }
@@ -261,19 +234,20 @@ bool VSLSQLiteDB::_performTwoParameterQuery(const char* sql, const char* kind, c
 bool VSLSQLiteDB::addCodeSigningEntry(const VSLCodeSigningEntry* entry, const std::optional<std::string>& identifier,
                                       VSLErrorRef* error) {
     if (!entry || !identifier)
-        return fail(error, VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true,
-                                     "codeSigningEntry %@ and identifier %@ cannot be nil", entry, identifier));
+        return failWithError(error,
+                             VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true,
+                                       "codeSigningEntry %@ and identifier %@ cannot be nil", entry, identifier));
     bool began = false;
     try {
         VSLErrorRef execError;
         if (!_sqliteExec("BEGIN;", &execError))
-            return fail(error, VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec begin"));
+            return failWithError(error, VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec begin"));
         began = true;
         VSLErrorRef stepError;
         if (!_insertCodeSigningInfo(*entry, *identifier, &stepError) ||
             !_insertCodeSigningData(*entry, *identifier, &stepError)) {
             _rollback(&stepError);
-            return fail(error, stepError);
+            return failWithError(error, stepError);
         }
         if (entry->childBundleIdentifiers) {
             for (const auto& child : *entry->childBundleIdentifiers) {
@@ -291,19 +265,21 @@ bool VSLSQLiteDB::addCodeSigningEntry(const VSLCodeSigningEntry* entry, const st
     } catch (...) {
         VSLErrorRef e = errorForCaughtException(__func__, __LINE__);
         if (began) _rollback(&e);
-        return fail(error, e);
+        return failWithError(error, e);
     }
 }
 
 bool VSLSQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::optional<std::string>& identifier,
                                                        VSLErrorRef* error) {
     if (!identifier)
-        return fail(error, VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true, "identifier %@ cannot be nil", identifier));
+        return failWithError(
+            error, VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true, "identifier %@ cannot be nil", identifier));
     VSLErrorRef queryError;
-    if (_performTwoParameterQuery(kDelete, "delete", *identifier, "sqlite3_bind_text for identifier=%@ at %@ failed: %s",
-                                  nullptr, 1, &queryError))
+    if (_performTwoParameterQuery(kDelete, "delete", *identifier,
+                                  "sqlite3_bind_text for identifier=%@ at %@ failed: %s", nullptr, 1, &queryError))
         return true;
-    return fail(error, VSL_ERROR(kVSLErrorDatabase, queryError, true, "failed to delete from code_signing_info"));
+    return failWithError(error,
+                         VSL_ERROR(kVSLErrorDatabase, queryError, true, "failed to delete from code_signing_info"));
 }
 
 bool VSLSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identifier, VSLErrorRef* error) {
@@ -311,23 +287,24 @@ bool VSLSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identif
     if (_performTwoParameterQuery(kInvalidate, "insert", identifier,
                                   "sqlite3_bind_text for identifier=%@ at %@ failed: %s", nullptr, -1, &queryError))
         return true;
-    return fail(error, VSL_ERROR(kVSLErrorDatabase, queryError, true, "failed to invalidate identifier %@", identifier));
+    return failWithError(
+        error, VSL_ERROR(kVSLErrorDatabase, queryError, true, "failed to invalidate identifier %@", identifier));
 }
 
 bool VSLSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, VSLErrorRef* error) {
     VSLErrorRef childError;
     auto children = childIdentifiersForParentIdentifier(identifier, &childError);
-    if (!children && !isVSLCode(childError, kVSLErrorNotInDatabase))
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, childError, true,
-                                     "Error retrieving child bundles ids from DB with identifier %@ : %@", identifier,
-                                     childError));
+    if (!children && !isErrorCode(childError, kVSLErrorNotInDatabase))
+        return failWithError(error, VSL_ERROR(kVSLErrorDatabase, childError, true,
+                                              "Error retrieving child bundles ids from DB with identifier %@ : %@",
+                                              identifier, childError));
     std::vector<std::string> list{identifier};
     if (children) list.insert(list.end(), children->begin(), children->end());
     bool began = false;
     try {
         VSLErrorRef execError;
         if (!_sqliteExec("BEGIN;", &execError))
-            return fail(error, VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec begin"));
+            return failWithError(error, VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec begin"));
         began = true;
         for (const auto& item : list) {
             VSLErrorRef itemError;
@@ -344,174 +321,21 @@ bool VSLSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
     } catch (...) {
         VSLErrorRef e = errorForCaughtException(__func__, __LINE__);
         if (began) _rollback(&e);
-        return fail(error, e);
+        return failWithError(error, e);
     }
 }
 
 bool VSLSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(VSLErrorRef* error) {
-    VSLSQLiteStatement statement(db_, url_);
+    VSLSQLiteStatement statement(*statements_);
     if (!statement.prepare(kDeleteAdvanceCopies, "delete", error)) return false;
     if (sqlite3_bind_int(statement.get(), 1, kFlagAdvanceCopy) != SQLITE_OK)
-        return fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true, "sqlite3_bind_text for flags=%d at %@ failed: %s",
-                                     kFlagAdvanceCopy, url_, sqlite3_errmsg(db_)));
+        return failWithError(
+            error, VSL_ERROR(kVSLErrorDatabase, nullptr, true, "sqlite3_bind_text for flags=%d at %@ failed: %s",
+                             kFlagAdvanceCopy, url_, sqlite3_errmsg(db_)));
     if (!statement.stepToDone(error)) return false;
     int changes = sqlite3_changes(db_);
     if (changes > 0) LogWrite(kLogLevelError, __func__, "Deleted %d advance copies of code signing info.", changes);
     return true;
-}
-
-// ---- reading ----
-
-std::optional<VSLCodeSigningEntry> VSLSQLiteDB::_codeSigningEntryFromStatementRow(sqlite3_stmt* s, VSLErrorRef* error) {
-    const void* blob = sqlite3_column_blob(s, 0);
-    if (!blob) {
-        fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true, "Failed to create code signing entry from statement row"));
-        return std::nullopt;
-    }
-    std::string why;
-    auto info = decodePropertyList(blob, static_cast<size_t>(sqlite3_column_bytes(s, 0)), &why);
-    if (!info || !info->isDictionary()) {
-        fail(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true, "Error formatting info data from DB"));
-        return std::nullopt;
-    }
-    VSLCodeSigningEntry entry = VSLCodeSigningEntry::initWithCodeSigningInfo(std::move(*info));
-    entry.invalid = sqlite3_column_int(s, 1) != 0;
-    int flags = sqlite3_column_int(s, 2);
-    entry.placeholder = (flags & kFlagPlaceholder) != 0;
-    entry.advanceCopy = (flags & kFlagAdvanceCopy) != 0;
-    entry.registeredByCaller = sqlite3_column_int(s, 3) != 0;
-    entry.dataContainerClass = static_cast<uint64_t>(static_cast<uint32_t>(sqlite3_column_int(s, 4)));
-    return entry;
-}
-
-std::optional<VSLCodeSigningEntry> VSLSQLiteDB::codeSigningEntryWithIdentifier(const std::string& identifier,
-                                                                               VSLErrorRef* error) {
-    std::optional<VSLCodeSigningEntry> entry;
-    {
-        VSLSQLiteStatement statement(db_, url_);
-        VSLErrorRef selectError;
-        int rc = SQLITE_ERROR;
-        if (statement.prepare(kSelectOne, "select", &selectError) &&
-            statement.bindText(1, identifier, "sqlite3_bind_text for identifier=%@ at %@ failed: %s", &selectError)) {
-            rc = statement.step();
-            if (rc == SQLITE_ROW)
-                entry = _codeSigningEntryFromStatementRow(statement.get(), &selectError);
-            else if (rc != SQLITE_DONE)
-                selectError = statement.stepError();
-        }
-        if (!entry) {
-            if (!selectError && rc == SQLITE_DONE) {
-                fail(error, VSL_ERROR(kVSLErrorNotInDatabase, nullptr, false, "Identifier: \"%@\" Not Found in DB",
-                                      identifier));
-                return std::nullopt;
-            }
-            LogWrite(kLogLevelError, __func__, "Error retrieving code signing entry: %@", selectError);
-            fail(error, selectError);
-            return std::nullopt;
-        }
-    }
-    VSLErrorRef childError;
-    if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
-        entry->childBundleIdentifiers = std::move(children);
-    } else if (!isVSLCode(childError, kVSLErrorNotInDatabase)) {
-        LogWrite(kLogLevelError, __func__, "Error retrieving childBundleIds: %@", childError);
-        fail(error, childError);
-        return std::nullopt;
-    }
-    return entry;
-}
-
-VSLErrorRef VSLSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const EnumerationBlock& block) {
-    VSLErrorRef result;
-    VSLSQLiteStatement statement(db_, url_);
-    if (!statement.prepare(kSelectAll, "select", &result)) return result;
-    for (;;) {
-        int rc = statement.step();
-        if (rc == SQLITE_DONE) break;
-        if (rc != SQLITE_ROW) return statement.stepError();
-        auto entry = _codeSigningEntryFromStatementRow(statement.get(), &result);
-        if (!entry) continue;
-        auto identifier = columnText(statement.get(), 5);
-        if (!identifier || identifier->empty()) {
-            result = VSL_ERROR(kVSLErrorDatabase, nullptr, true, "Error retrieving code_signing_id_text from DB");
-            continue;
-        }
-        VSLErrorRef childError;
-        if (auto children = childIdentifiersForParentIdentifier(*identifier, &childError)) {
-            entry->childBundleIdentifiers = std::move(children);
-        } else if (!isVSLCode(childError, kVSLErrorNotInDatabase)) {
-            result = VSL_ERROR(kVSLErrorDatabase, childError, true, "Error retrieving childBundleIds: %@", childError);
-            continue;
-        }
-        block(*identifier, *entry);
-    }
-    return result;
-}
-
-std::optional<std::set<std::string>> VSLSQLiteDB::identifiersWithError(VSLErrorRef* error) {
-    VSLSQLiteStatement statement(db_, url_);
-    if (!statement.prepare(kSelectIdentifiers, "select", error)) return std::nullopt;
-    std::set<std::string> identifiers;
-    for (;;) {
-        int rc = statement.step();
-        if (rc == SQLITE_DONE) return identifiers;
-        if (rc != SQLITE_ROW) {
-            fail(error, statement.stepError());
-            return std::nullopt;
-        }
-        if (auto text = columnText(statement.get(), 0)) identifiers.insert(std::move(*text));
-    }
-}
-
-std::optional<std::vector<std::string>> VSLSQLiteDB::childIdentifiersForParentIdentifier(const std::string& parent,
-                                                                                         VSLErrorRef* error) {
-    VSLSQLiteStatement statement(db_, url_);
-    if (!statement.prepare(kSelectChildren, "select", error) ||
-        !statement.bindText(1, parent, "sqlite3_bind_text for identifier=%@ at %@ failed: %s", error))
-        return std::nullopt;
-    std::vector<std::string> children;
-    for (;;) {
-        int rc = statement.step();
-        if (rc == SQLITE_DONE) break;
-        if (rc != SQLITE_ROW) {
-            fail(error, statement.stepError());
-            return std::nullopt;
-        }
-        auto text = columnText(statement.get(), 0);
-        if (!text) {
-            fail(error, VSL_ERROR(kVSLErrorAllocation, nullptr, true,
-                                  "Failed to allocate thisChildBundleId for text: %s", "(null)"));
-            return std::nullopt;
-        }
-        children.push_back(std::move(*text));
-    }
-    if (children.empty()) {
-        fail(error, VSL_ERROR(kVSLErrorNotInDatabase, nullptr, false,
-                              "Children for parent identifier: \"%@\" Not Found in DB", parent));
-        return std::nullopt;
-    }
-    return children;
-}
-
-std::optional<std::string> VSLSQLiteDB::parentIdentifierForChildIdentifier(const std::string& child,
-                                                                           VSLErrorRef* error) {
-    VSLSQLiteStatement statement(db_, url_);
-    if (!statement.prepare(kSelectParent, "select", error) ||
-        !statement.bindText(1, child, "sqlite3_bind_text for identifier=%@ at %@ failed: %s", error))
-        return std::nullopt;
-    int rc = statement.step();
-    if (rc == SQLITE_ROW) {
-        if (auto text = columnText(statement.get(), 0)) return text;
-        fail(error, VSL_ERROR(kVSLErrorAllocation, nullptr, true, "Failed to allocate parentIdentifier for text: %s",
-                              "(null)"));
-        return std::nullopt;
-    }
-    if (rc != SQLITE_DONE) {
-        fail(error, statement.stepError());
-        return std::nullopt;
-    }
-    fail(error, VSL_ERROR(kVSLErrorNotInDatabase, nullptr, false, "Parent identifier for: \"%@\" Not Found in DB", child));
-    return std::nullopt;
 }
 
 }  // namespace vsl

@@ -20,6 +20,8 @@ struct sqlite3_stmt;
 
 namespace vsl {
 
+class VSLSQLiteStatementCache;
+
 extern const char* const kVSLCodeSigningDatabaseFileName;  // "containers.sqlite3"
 
 class VSLSQLiteDB {
@@ -62,6 +64,10 @@ public:
     bool deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(VSLErrorRef* error);
 
 private:
+    // Bits of the `placeholder` column.
+    static constexpr int kFlagPlaceholder = 1;
+    static constexpr int kFlagAdvanceCopy = 2;
+
     bool _sqliteExec(const char* sql, VSLErrorRef* error);
     bool _performInsertOrUpdateQuery(const char* sql, const VSLCodeSigningEntry& entry, const std::string& identifier,
                                      bool isUpdate, VSLErrorRef* error);
@@ -71,13 +77,13 @@ private:
     bool _performTwoParameterQuery(const char* sql, const char* kind, const std::string& textOne,
                                    const char* textOneFailureFormat, const std::string* textTwo, int expectedChanges,
                                    VSLErrorRef* error);
-    std::optional<VSLCodeSigningEntry> _codeSigningEntryFromStatementRow(sqlite3_stmt* statement,
-                                                                         VSLErrorRef* error);
+    std::optional<VSLCodeSigningEntry> _codeSigningEntryFromStatementRow(sqlite3_stmt* statement, VSLErrorRef* error);
     // Rolls back an open transaction; false (with a code-66 error) when that fails.
     bool _rollback(VSLErrorRef* error);
 
     sqlite3* db_;
     std::string url_;
+    std::unique_ptr<VSLSQLiteStatementCache> statements_;
 };
 
 }  // namespace vsl

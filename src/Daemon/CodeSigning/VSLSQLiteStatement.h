@@ -1,19 +1,53 @@
-// One prepared statement of the code-signing database, finalised when it goes out
-// of scope (every statement is prepared, bound, stepped and finalised per call).
+// One use of a statement of the code-signing database: prepared (or taken from the
+// connection's cache of prepared statements), bound, stepped, and reset with its
+// bindings cleared when it goes out of scope.
 #pragma once
 
 #include <sqlite3.h>
 
 #include <string>
+#include <unordered_map>
 
 #include "Daemon/Core/VSLError.h"
 
 namespace vsl {
 
+// Hands `error` out (when asked for) and answers false: every failure here.
+inline bool failWithError(VSLErrorRef* out, VSLErrorRef error) {
+    if (out) *out = std::move(error);
+    return false;
+}
+
+inline bool isErrorCode(const VSLErrorRef& e, uint64_t code) {
+    return e && e->isVSLDomain() && static_cast<uint64_t>(e->code) == code;
+}
+
+// Prepared statements of one connection, keyed by their text. Preparing is most of
+// the cost of a one-row query, and the daemon asks for the caller's entry on every
+// message.
+class VSLSQLiteStatementCache {
+public:
+    VSLSQLiteStatementCache(sqlite3* db, const std::string& path) : db_(db), path_(path) {}
+    ~VSLSQLiteStatementCache() { finalizeAll(); }
+    VSLSQLiteStatementCache(const VSLSQLiteStatementCache&) = delete;
+    VSLSQLiteStatementCache& operator=(const VSLSQLiteStatementCache&) = delete;
+    // Before the connection closes.
+    void finalizeAll();
+
+private:
+    friend class VSLSQLiteStatement;
+    struct Slot {
+        sqlite3_stmt* statement = nullptr;
+        bool inUse = false;
+    };
+    sqlite3* db_;
+    const std::string& path_;
+    std::unordered_map<std::string, Slot> slots_;
+};
+
 class VSLSQLiteStatement {
 public:
-    // `path` names the database file in messages.
-    VSLSQLiteStatement(sqlite3* db, const std::string& path) : db_(db), path_(path) {}
+    explicit VSLSQLiteStatement(VSLSQLiteStatementCache& cache) : cache_(cache) {}
     ~VSLSQLiteStatement();
     VSLSQLiteStatement(const VSLSQLiteStatement&) = delete;
     VSLSQLiteStatement& operator=(const VSLSQLiteStatement&) = delete;
@@ -33,15 +67,11 @@ public:
     VSLErrorRef stepError() const;
 
     sqlite3_stmt* get() const { return stmt_; }
-    sqlite3* db() const { return db_; }
-    const std::string& path() const { return path_; }
-    const char* sql() const { return sql_; }
 
 private:
-    sqlite3* db_;
-    const std::string& path_;
+    VSLSQLiteStatementCache& cache_;
     sqlite3_stmt* stmt_ = nullptr;
-    const char* sql_ = "";
+    VSLSQLiteStatementCache::Slot* slot_ = nullptr;  // none: prepared for this use only
 };
 
 }  // namespace vsl

@@ -76,12 +76,14 @@ std::shared_ptr<const VSLWhitelist> VSLWhitelist::sharedWhitelist() {
 
 VSLWhitelist::VSLWhitelist(IdentifierMapping systemContainerMapping, IdentifierMapping systemGroupContainerMapping,
                            const Value& whitelistedContainerMapping, const Value& whitelistedCodeSignIdentifierMapping)
-    : systemWhitelist_(std::move(systemContainerMapping)), systemGroupWhitelist_(std::move(systemGroupContainerMapping)) {
+    : systemWhitelist_(std::move(systemContainerMapping)),
+      systemGroupWhitelist_(std::move(systemGroupContainerMapping)) {
     for (VSLContainerClass c = 0; c < kVSLClassMax; c++) {
         const Value* items = whitelistedContainerMapping.find(std::to_string(c));
         if (items && items->arrayValue()) whitelistedLookupByContainer_[c] = setOfStrings(*items->arrayValue());
     }
-    whitelistedLookupByCodeSignIdentifier_ = _convertArraysToSetsInNestedDictionary(whitelistedCodeSignIdentifierMapping);
+    whitelistedLookupByCodeSignIdentifier_ =
+        _convertArraysToSetsInNestedDictionary(whitelistedCodeSignIdentifierMapping);
 }
 
 VSLWhitelistNode VSLWhitelist::_convertArraysToSetsInNestedDictionary(const Value& dictionary) {
@@ -125,9 +127,13 @@ bool VSLWhitelist::systemGroupContainerIdIsWellknown(const std::string& identifi
     return systemGroupWhitelist_.count(identifier) != 0;
 }
 
-std::vector<std::string> VSLWhitelist::wellknownSystemContainers() const { return keys(systemWhitelist_); }
+std::vector<std::string> VSLWhitelist::wellknownSystemContainers() const {
+    return keys(systemWhitelist_);
+}
 
-std::vector<std::string> VSLWhitelist::wellknownSystemGroupContainers() const { return keys(systemGroupWhitelist_); }
+std::vector<std::string> VSLWhitelist::wellknownSystemGroupContainers() const {
+    return keys(systemGroupWhitelist_);
+}
 
 bool VSLWhitelist::containerIdIsWellknown(const std::string& identifier, VSLContainerClass containerClass) const {
     if (containerClass == kVSLClassSystemData) return systemContainerIdIsWellknown(identifier);

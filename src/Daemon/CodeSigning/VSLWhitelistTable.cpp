@@ -8,14 +8,10 @@ const std::array<const char*, 2> kVSLWellKnownSystemContainers = {
 };
 
 const std::array<const char*, 8> kVSLWellKnownSystemGroupContainers = {
-    "systemgroup.com.tarrow.sharedsettings",
-    "systemgroup.com.tarrow.deviceconfiguration",
-    "systemgroup.com.tarrow.networkpolicy",
-    "systemgroup.com.tarrow.installlogs",
-    "systemgroup.com.tarrow.mediaindex",
-    "systemgroup.com.tarrow.telephony",
-    "systemgroup.com.tarrow.fontregistry",
-    "systemgroup.com.tarrow.sharedcredentials",
+    "systemgroup.com.tarrow.sharedsettings", "systemgroup.com.tarrow.deviceconfiguration",
+    "systemgroup.com.tarrow.networkpolicy",  "systemgroup.com.tarrow.installlogs",
+    "systemgroup.com.tarrow.mediaindex",     "systemgroup.com.tarrow.telephony",
+    "systemgroup.com.tarrow.fontregistry",   "systemgroup.com.tarrow.sharedcredentials",
 };
 
 const char* const kVSLInternalSystemGroupContainer = "systemgroup.com.tarrow.coveragedata";

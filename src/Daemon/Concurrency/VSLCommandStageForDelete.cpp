@@ -72,7 +72,8 @@ bool VSLCommandStageForDelete::stageAll(const std::shared_ptr<VSLCommandQueue>& 
         if (!container) continue;
 
         std::string destination = deathrow + "/" + lastPathComponent(container->url());
-        if (isBundleContainerClass(container->containerClass()) && shouldRemoveCodeSigningRecords(*container, *pending)) {
+        if (isBundleContainerClass(container->containerClass()) &&
+            shouldRemoveCodeSigningRecords(*container, *pending)) {
             if (auto mapping = VSLCodeSigningMapping::sharedInstance())
                 mapping->removeCodeSigningDictionariesForIdentifierAndItsChildren(container->identifier(), queue);
         }
@@ -93,10 +94,10 @@ bool VSLCommandStageForDelete::stageAll(const std::shared_ptr<VSLCommandQueue>& 
         VSLErrorRef removeError;
         if (!cache->removeContainerForUserIdentity(container->userIdentity(), container->containerClass(),
                                                    container->identifier(), container->transient(), &removeError)) {
-            *pending = VSL_ERROR(kVSLErrorCacheRemove, removeError, true,
-                                 "Failed to remove from cache id: %@, class: %ld, transient: %d",
-                                 container->identifier(), static_cast<long>(container->containerClass()),
-                                 container->transient());
+            *pending =
+                VSL_ERROR(kVSLErrorCacheRemove, removeError, true,
+                          "Failed to remove from cache id: %@, class: %ld, transient: %d", container->identifier(),
+                          static_cast<long>(container->containerClass()), container->transient());
             return false;
         }
     }

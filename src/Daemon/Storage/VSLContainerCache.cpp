@@ -1,6 +1,7 @@
 #include "Daemon/Storage/VSLContainerCache.h"
 
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
+#include "Daemon/CodeSigning/VSLWhitelist.h"
 #include "Daemon/Core/VSLExceptionGuard.h"
 #include "Daemon/Core/VSLInvariant.h"
 #include "Daemon/Storage/VSLFileManager.h"
@@ -85,8 +86,10 @@ bool VSLContainerCache::containerURLIsValidForContainerClass(const std::string& 
                                                              VSLContainerClass containerClass) const {
     std::string name = lastPathComponent(url);
     if (Uuid::parse(name)) return true;
-    return isSystemContainerClass(containerClass) && hooks_.isWellKnownContainerName &&
-           hooks_.isWellKnownContainerName(containerClass, name);
+    if (!isSystemContainerClass(containerClass)) return false;
+    if (hooks_.isWellKnownContainerName) return hooks_.isWellKnownContainerName(containerClass, name);
+    auto whitelist = VSLWhitelist::sharedWhitelist();
+    return whitelist && whitelist->containerIdIsWellknown(name, containerClass);
 }
 
 bool VSLContainerCache::_lock_getCache(ClassIndex& index, const std::string& key,

@@ -41,7 +41,8 @@ public:
         // test lock makes rebuilds wait).
         std::function<void(const std::string& cacheKey, bool transient, const std::string& classDirectory)>
             willScanClassDirectory;
-        // Whether a class 12 or 13 directory entry bears a well-known container name.
+        // Whether a class 12 or 13 directory entry bears a well-known container name
+        // (default: the shared whitelist).
         std::function<bool(VSLContainerClass containerClass, const std::string& name)> isWellKnownContainerName;
         // Posts CONTAINER_NOTIFY_USER_INVALIDATED; returns 0 or the failure status.
         std::function<uint32_t()> postUserInvalidatedNotification;
