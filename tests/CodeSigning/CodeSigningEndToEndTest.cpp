@@ -17,11 +17,6 @@ namespace {
 
 const char* const kAllowed = "com.tarrow.private.Vesselry.allowed";
 
-uint64_t replyCode(const DaemonProcess::CtlResult& r) {
-    const Value* c = r.reply.find("ReplyError");
-    return c && c->uint64Value() ? *c->uint64Value() : 0;
-}
-
 std::string plistFile(const DaemonProcess& daemon, const std::string& name, const Value& value) {
     std::string path = daemon.at(name);
     auto bytes = encodeBinaryPropertyList(value, nullptr);
@@ -57,47 +52,47 @@ TEST(CodeSigningEndToEnd, CommandsStoreReturnAndInvalidateCodeSigningInfo) {
 
     auto r =
         daemon.run(installer, {"processCodeSigningInfo", "Identifier=com.example.app", "CodeSigningInfo=@" + infoPath});
-    ASSERT_EQ(1u, replyCode(r)) << r.err;
+    ASSERT_EQ(1u, r.code()) << r.err;
     r = daemon.run(installer, {"processCodeSigningInfo", "Identifier=com.example.app.widget",
                                "CodeSigningInfo=@" + infoPath, "OptionsDictionary=@" + childOptions});
-    ASSERT_EQ(1u, replyCode(r)) << r.err;
+    ASSERT_EQ(1u, r.code()) << r.err;
     r = daemon.run(installer, {"processCodeSigningInfo", "CodeSigningInfo=@" + infoPath});
-    EXPECT_EQ(18u, replyCode(r)) << "no identifier";
+    EXPECT_EQ(18u, r.code()) << "no identifier";
     r = daemon.run(stranger, {"processCodeSigningInfo", "Identifier=com.example.evil", "CodeSigningInfo=@" + infoPath});
-    EXPECT_EQ(55u, replyCode(r)) << "not entitled";
+    EXPECT_EQ(55u, r.code()) << "not entitled";
 
     r = daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app"});
-    ASSERT_EQ(1u, replyCode(r)) << r.err;
+    ASSERT_EQ(1u, r.code()) << r.err;
     const Value* returned = r.reply.find("ReplyInfoDictionary");
     ASSERT_TRUE(returned);
     EXPECT_TRUE(propertyListValuesEqual(info, *returned)) << returned->description();
     r = daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.unknown"});
-    EXPECT_EQ(21u, replyCode(r));
+    EXPECT_EQ(21u, r.code());
     EXPECT_FALSE(r.reply.find("ReplyInfoDictionary"));
     // Every entitled message registers its sender's own entitlements.
     r = daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.installer"});
-    ASSERT_EQ(1u, replyCode(r));
+    ASSERT_EQ(1u, r.code());
     EXPECT_TRUE(
         propertyListValuesEqual(dict({{"com.tarrow.Vesselry.Entitlements", dict({{kAllowed, Value::boolean(true)}})}}),
                                 *r.reply.find("ReplyInfoDictionary")));
 
     // No bundle container exists for anything registered here.
     r = daemon.run(installer, {"invalidateCodeSigningInfo"});
-    EXPECT_EQ(1u, replyCode(r)) << r.err;
-    EXPECT_EQ(21u, replyCode(daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app"})));
-    EXPECT_EQ(21u, replyCode(daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app.widget"})))
+    EXPECT_EQ(1u, r.code()) << r.err;
+    EXPECT_EQ(21u, daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app"}).code());
+    EXPECT_EQ(21u, daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app.widget"}).code())
         << "invalidated with its parent";
-    EXPECT_EQ(1u, replyCode(daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.installer"})))
+    EXPECT_EQ(1u, daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.installer"}).code())
         << "caller-registered entries are kept";
 
     // Registered again, the entry is valid again; and it outlives the daemon.
-    ASSERT_EQ(1u, replyCode(daemon.run(installer, {"processCodeSigningInfo", "Identifier=com.example.app",
-                                                   "CodeSigningInfo=@" + infoPath})));
+    ASSERT_EQ(1u, daemon.run(installer, {"processCodeSigningInfo", "Identifier=com.example.app",
+                                                   "CodeSigningInfo=@" + infoPath}).code());
     EXPECT_EQ(0, daemon.stop());
     EXPECT_TRUE(readFile(databasePath(daemon)).size() > 0);
     ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
     r = daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app"});
-    ASSERT_EQ(1u, replyCode(r)) << r.err;
+    ASSERT_EQ(1u, r.code()) << r.err;
     EXPECT_TRUE(propertyListValuesEqual(info, *r.reply.find("ReplyInfoDictionary")));
     EXPECT_EQ(0, daemon.stop());
 }
@@ -116,10 +111,10 @@ TEST(CodeSigningEndToEnd, ACorruptDatabaseStopsTheDaemonUntilItIsMovedAside) {
         std::fwrite(junk.data(), 1, junk.size(), f);
         std::fclose(f);
     }
-    ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
+    // The database is opened at start: the daemon stops before it serves anyone.
+    EXPECT_FALSE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
     auto r = daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app"});
-    EXPECT_EQ(3, r.exitCode) << "the client loses the daemon: " << r.err;
-    daemon.stop();
+    EXPECT_EQ(3, r.exitCode) << "the client cannot reach a daemon: " << r.err;
     std::string stderrText = readFile(daemon.at("vesseld.stderr"));
     EXPECT_NE(std::string::npos, stderrText.find("Failed to initialize database, err = 26")) << stderrText;
     std::string logText = readFile(daemon.at("private/var/root/Library/Logs/Vesselry/vesseld.log"));
@@ -128,7 +123,7 @@ TEST(CodeSigningEndToEnd, ACorruptDatabaseStopsTheDaemonUntilItIsMovedAside) {
 
     ASSERT_EQ(0, std::rename(path.c_str(), (path + ".corrupt").c_str()));
     ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
-    EXPECT_EQ(21u, replyCode(daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app"})))
+    EXPECT_EQ(21u, daemon.run(installer, {"getCodeSigningInfo", "Identifier=com.example.app"}).code())
         << "a fresh, empty database";
     EXPECT_EQ(0, daemon.stop());
 }

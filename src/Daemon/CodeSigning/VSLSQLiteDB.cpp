@@ -199,7 +199,7 @@ bool VSLSQLiteDB::_insertCodeSigningData(const VSLCodeSigningEntry& entry, const
     if (entry.codeSigningInfo) blob = encodeBinaryPropertyList(*entry.codeSigningInfo, &why);
     if (!blob)
         return failWithError(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true,
-                                              "Error creating NSData from code signing info: %@", why));
+                                              "Error creating data from code signing info: %@", why));
     VSLSQLiteStatement statement(*statements_);
     if (!statement.prepare(kInsertData, "insert", error)) return false;
     if (sqlite3_bind_blob64(statement.get(), 1, blob->data(), blob->size(), SQLITE_STATIC) != SQLITE_OK)

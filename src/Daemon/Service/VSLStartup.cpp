@@ -4,6 +4,7 @@
 
 #include <cstdlib>
 
+#include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Service/VSLCommandTable.h"
 #include "Platform/CrashAnnotation.h"
@@ -39,6 +40,14 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     }
     if (validateCommandTable() != 0)
         LogWrite(kLogLevelError, "vesseld_init", "The command table is inconsistent; affected commands answer 49");
+    // Opens the code-signing database now, so an unusable file stops the daemon at
+    // start rather than at the first request; advance copies never outlive a restart.
+    if (auto mapping = VSLCodeSigningMapping::sharedInstance()) {
+        VSLErrorRef error;
+        if (!mapping->removeAllAdvanceCopiesWithError(&error))
+            LogWrite(kLogLevelError, "vesseld_init", "Failed to remove advance copies: %@", error);
+    }
+
     // Every start: whatever a crash left on death row is destroyed in the background.
     VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);
 

@@ -99,6 +99,13 @@ int main(int argc, char** argv) {
                                              std::chrono::milliseconds(timeoutSeconds * 1000));
     if (!reply.ok()) {
         std::fprintf(stderr, "vesselctl: %s: %s\n", statusName(reply.status), reply.error.c_str());
+        if (reply.status == VSLConnectionStatus::Closed)
+            std::fprintf(stderr,
+                         "  vesseld stopped while handling the request; see vesseld.log in\n"
+                         "  %s/private/var/root/Library/Logs/Vesselry. An unusable code-signing database\n"
+                         "  (containers.sqlite3 in private/var/root/Library/Vesselry) is reported there:\n"
+                         "  move it aside and restart vesseld; installers register their information again.\n",
+                         root == "/" ? "" : root.c_str());
         return 3;
     }
     if (asPlist) {
