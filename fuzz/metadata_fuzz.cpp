@@ -7,6 +7,7 @@
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
+#include <filesystem>
 #include <fstream>
 #include <string>
 
@@ -40,6 +41,11 @@ World& world() {
         char templ[] = "/tmp/vessel-metadata-fuzz-XXXXXX";
         if (!::mkdtemp(templ)) std::abort();
         std::string root = templ;
+        static const std::string removeAtExit = root;
+        std::atexit([] {
+            std::error_code ignored;
+            std::filesystem::remove_all(removeAtExit, ignored);
+        });
         for (const char* dir : {"/etc", "/private", "/private/var", "/private/var/mobile"})
             ::mkdir((root + dir).c_str(), 0755);
         std::string passwd = "root:x:0:0::/private/var/root:/bin/sh\nmobile:x:501:501::/private/var/mobile:/bin/sh\n";

@@ -79,6 +79,27 @@ plist_t toPlist(const Value& v, std::string* error) {
 
 constexpr int kMaxDepth = 128;
 
+// UTF-8 without NUL: what a string of the platform can hold.
+bool validText(const std::string& s) {
+    size_t i = 0;
+    while (i < s.size()) {
+        unsigned char c = static_cast<unsigned char>(s[i]);
+        if (c == 0) return false;
+        int n = c < 0x80 ? 0 : (c >> 5) == 6 ? 1 : (c >> 4) == 14 ? 2 : (c >> 3) == 30 ? 3 : -1;
+        if (n < 0 || i + static_cast<size_t>(n) >= s.size()) return false;
+        uint32_t cp = n == 0 ? c : c & (0x3F >> n);
+        for (int k = 1; k <= n; k++) {
+            unsigned char d = static_cast<unsigned char>(s[i + k]);
+            if ((d >> 6) != 2) return false;
+            cp = (cp << 6) | (d & 0x3F);
+        }
+        static const uint32_t minimum[] = {0, 0x80, 0x800, 0x10000};
+        if (cp < minimum[n] || cp > 0x10FFFF || (cp >= 0xD800 && cp <= 0xDFFF)) return false;
+        i += static_cast<size_t>(n) + 1;
+    }
+    return true;
+}
+
 std::optional<Value> fromPlist(plist_t p, int depth, std::string* error) {
     if (depth > kMaxDepth) {
         if (error) *error = "property list nested too deeply";
@@ -109,10 +130,13 @@ std::optional<Value> fromPlist(plist_t p, int depth, std::string* error) {
         }
         case PLIST_STRING:
         case PLIST_KEY: {
-            char* s = nullptr;
-            plist_get_string_val(p, &s);
-            std::string str = s ? s : "";
-            std::free(s);
+            uint64_t length = 0;
+            const char* s = plist_get_string_ptr(p, &length);
+            std::string str = s ? std::string(s, length) : std::string();
+            if (!validText(str)) {
+                if (error) *error = "string is not valid UTF-8";
+                return std::nullopt;
+            }
             return Value::string(std::move(str));
         }
         case PLIST_DATA: {
@@ -155,6 +179,10 @@ std::optional<Value> fromPlist(plist_t p, int depth, std::string* error) {
                 auto v = fromPlist(item, depth + 1, error);
                 std::string k = key ? key : "";
                 std::free(key);
+                if (v && !validText(k)) {
+                    if (error) *error = "key is not valid UTF-8";
+                    v.reset();
+                }
                 if (!v) {
                     std::free(it);
                     return std::nullopt;
@@ -187,9 +215,77 @@ std::optional<std::string> encodeBinaryPropertyList(const Value& root, std::stri
     return out;
 }
 
+namespace {
+
+uint64_t bigEndian(const uint8_t* p, size_t n) {
+    uint64_t v = 0;
+    for (size_t i = 0; i < n; i++) v = (v << 8) | p[i];
+    return v;
+}
+
+// The parser aborts on strings and keys that hold a NUL, so a binary property
+// list is screened first: every string object is checked before it is parsed. Any
+// structure that does not add up is refused here as well.
+bool screenBinaryPropertyList(const uint8_t* b, size_t n) {
+    if (n < 8 + 32) return false;
+    const uint8_t* trailer = b + n - 32;
+    size_t offsetSize = trailer[6];
+    uint64_t count = bigEndian(trailer + 8, 8);
+    uint64_t tableOffset = bigEndian(trailer + 24, 8);
+    if (offsetSize == 0 || offsetSize > 8 || tableOffset >= n - 32 || count > (n - 32 - tableOffset) / offsetSize)
+        return false;
+    for (uint64_t i = 0; i < count; i++) {
+        uint64_t o = bigEndian(b + tableOffset + i * offsetSize, offsetSize);
+        if (o < 8 || o >= tableOffset) return false;
+        uint8_t marker = b[o];
+        unsigned type = marker >> 4;
+        if (type != 5 && type != 6) continue;
+        uint64_t length = marker & 0xF;
+        uint64_t start = o + 1;
+        if (length == 0xF) {
+            if (start >= tableOffset || (b[start] >> 4) != 1) return false;
+            size_t intSize = size_t(1) << (b[start] & 0xF);
+            if (intSize > 8 || start + 1 + intSize > tableOffset) return false;
+            length = bigEndian(b + start + 1, intSize);
+            start += 1 + intSize;
+        }
+        uint64_t unit = type == 6 ? 2 : 1;
+        if (length > (tableOffset - start) / unit) return false;
+        for (uint64_t k = 0; k < length; k++) {
+            const uint8_t* c = b + start + k * unit;
+            if (unit == 1 ? c[0] == 0 : (c[0] == 0 && c[1] == 0)) return false;
+        }
+    }
+    return true;
+}
+
+// An XML property list with a NUL, raw or as a character reference, is refused
+// before it reaches the parser for the same reason.
+bool screenTextPropertyList(const char* t, size_t n) {
+    if (std::memchr(t, 0, n)) return false;
+    for (size_t i = 0; i + 2 < n; i++) {
+        if (t[i] != '&' || t[i + 1] != '#') continue;
+        size_t j = i + 2;
+        if (j < n && (t[j] == 'x' || t[j] == 'X')) j++;
+        size_t digits = j;
+        while (j < n && t[j] == '0') j++;
+        if (j > digits && j < n && t[j] == ';') return false;
+    }
+    return true;
+}
+
+}  // namespace
+
 std::optional<Value> decodePropertyList(const void* bytes, size_t length, std::string* error) {
     if (length == 0 || length > std::numeric_limits<uint32_t>::max()) {
         if (error) *error = length == 0 ? "empty property list" : "property list too large";
+        return std::nullopt;
+    }
+    const char* text = static_cast<const char*>(bytes);
+    bool binary = length >= 8 && std::memcmp(text, "bplist00", 8) == 0;
+    if (binary ? !screenBinaryPropertyList(static_cast<const uint8_t*>(bytes), length)
+               : !screenTextPropertyList(text, length)) {
+        if (error) *error = "malformed property list";
         return std::nullopt;
     }
     plist_t raw = nullptr;

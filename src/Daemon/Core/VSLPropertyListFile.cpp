@@ -52,8 +52,8 @@ std::optional<Value> VSL_dictionaryWithContentsOfURL(const std::string& path, un
         if (error) *error = VSL_POSIX_ERROR(err, "Failed to open %@: %s", path, std::strerror(err));
         return std::nullopt;
     }
-    // Read without the page cache's help where possible: the file is the ground truth.
-    posix_fadvise(fd, 0, 0, POSIX_FADV_DONTNEED);
+    // Read from the file itself each time (no parsed copy is kept anywhere); the page
+    // cache is coherent with the file, and dropping it made class rebuilds ~6x slower.
     struct stat st;
     if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode) || static_cast<size_t>(st.st_size) > kVSLMaxPropertyListFileSize) {
         int err = S_ISREG(st.st_mode) ? EFBIG : EINVAL;
