@@ -15,15 +15,16 @@ namespace {
 
 test::TempRoot* gRoot = nullptr;
 
-Value persona(uint64_t type, uint64_t id, std::optional<std::string> unique, std::vector<std::string> bundles,
+// An empty unique string means the persona has none.
+Value persona(uint64_t type, uint64_t id, const std::string& unique, std::vector<std::string> bundles,
               bool universal = false) {
     Dictionary d{{"PersonaType", Value::uint64(type)}, {"KernelPersonaID", Value::uint64(id)},
                  {"UID", Value::uint64(501)}, {"GID", Value::uint64(501)}};
-    if (unique) d["PersonaUniqueString"] = Value::string(*unique);
+    if (!unique.empty()) d["PersonaUniqueString"] = Value::string(unique);
     Array b;
     for (auto& s : bundles) b.push_back(Value::string(s));
     d["BundleIdentifiers"] = Value::array(std::move(b));
-    if (type == 1) d["HomeDirectory"] = Value::string("/private/var/PersonaVolumes/" + *unique);
+    if (type == 1) d["HomeDirectory"] = Value::string("/private/var/PersonaVolumes/" + unique);
     if (universal) d["Universal"] = Value::boolean(true);
     return Value::dictionary(std::move(d));
 }
@@ -35,7 +36,7 @@ public:
         auto list = encodeBinaryPropertyList(
             Value::array({persona(0, 1000, "P", {}), persona(1, 1001, "E1", {"com.example.mail", "com.example.both"}),
                           persona(1, 1002, "E2", {"com.example.both"}),
-                          persona(2, 900, std::nullopt, {"com.example.phone"}, true)}),
+                          persona(2, 900, "", {"com.example.phone"}, true)}),
             nullptr);
         gRoot->writeFile("etc/vesseld/personas.plist", *list);
         gRoot->writeDeviceFacts(dict({{"PersonasSupported", Value::boolean(true)}}));
