@@ -181,16 +181,17 @@ bool sameUserIdentity(const VSLUserIdentityRef& a, const VSLUserIdentityRef& b) 
 namespace vsl {
 
 VSLUserIdentityRef defaultUserIdentity() {
-    static VSLUserIdentityRef identity;
-    static std::once_flag once;
-    std::call_once(once, [] {
+    // Never destroyed: background queues may still ask for it while the process exits.
+    static const VSLUserIdentityRef* identity = [] {
         auto mobile = passwordEntryForName("mobile");
         uid_t uid = mobile ? mobile->uid : 0;
         gid_t gid = mobile ? mobile->gid : 0;
-        identity = VSLUserIdentity::create(uid, gid, VSLFileManager::homeDirectoryURLForPOSIXUID(uid), std::nullopt,
-                                           kVSLPersonaTypePersonal, static_cast<int32_t>(uid));
-    });
-    return identity;
+        return new VSLUserIdentityRef(VSLUserIdentity::create(uid, gid,
+                                                              VSLFileManager::homeDirectoryURLForPOSIXUID(uid),
+                                                              std::nullopt, kVSLPersonaTypePersonal,
+                                                              static_cast<int32_t>(uid)));
+    }();
+    return *identity;
 }
 
 }  // namespace vsl
