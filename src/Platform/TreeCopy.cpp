@@ -13,6 +13,7 @@
 
 #include "Platform/DirectoryEntries.h"
 #include "Platform/DurableIO.h"
+#include "Platform/UniqueFd.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {
@@ -22,20 +23,6 @@ namespace {
 const char* const kAccessAclName = "system.posix_acl_access";
 const char* const kDefaultAclName = "system.posix_acl_default";
 
-class Fd {
-public:
-    explicit Fd(int fd = -1) : fd_(fd) {}
-    ~Fd() {
-        if (fd_ >= 0) ::close(fd_);
-    }
-    Fd(const Fd&) = delete;
-    Fd& operator=(const Fd&) = delete;
-    int get() const { return fd_; }
-    int* out() { return &fd_; }
-
-private:
-    int fd_;
-};
 
 bool unsupported(int err) { return err == ENOTSUP || err == EOPNOTSUPP; }
 
@@ -59,9 +46,9 @@ public:
         : failedPath_(failedPath), euid_(::geteuid()), egid_(::getegid()), umask_(processUmask()) {}
 
     int copyTop(const std::string& from, const std::string& to) {
-        Fd srcDir(::open(parentPath(from).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        UniqueFd srcDir(::open(parentPath(from).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         if (srcDir.get() < 0) return fail(errno, from);
-        Fd dstDir(::open(parentPath(to).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+        UniqueFd dstDir(::open(parentPath(to).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
         if (dstDir.get() < 0) return fail(errno, to);
         if (isWithin(to, from)) return fail(EINVAL, to);
         std::string srcName = lastPathComponent(from), dstName = lastPathComponent(to);
@@ -121,12 +108,12 @@ private:
 
     int copyFile(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
                  const std::string& from, const std::string& to, bool parentIsOurs) {
-        Fd src(::openat(srcDir, srcName, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+        UniqueFd src(::openat(srcDir, srcName, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
         if (src.get() < 0) return fail(errno, from);
         mode_t mode = st.st_mode & 07777;
         // Born with its final mode when nothing (umask, set-id bits) can change it.
         bool exact = parentIsOurs && umask_ >= 0 && (mode & 07000) == 0 && (mode & ~static_cast<mode_t>(umask_)) == mode;
-        Fd dst;
+        UniqueFd dst;
         int rc = makeReplacing(dstDir, dstName, to,
                                [&] { return durable::createFileAt(dstDir, dstName, exact ? mode : 0600, to, dst.out()); });
         if (rc) return fail(rc, to);
@@ -136,7 +123,7 @@ private:
 
     int copyDirectory(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
                       const std::string& from, const std::string& to, bool parentIsOurs) {
-        Fd src(::openat(srcDir, srcName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        UniqueFd src(::openat(srcDir, srcName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
         if (src.get() < 0) return fail(errno, from);
         int rc = durable::makeDirectoryAt(dstDir, dstName, 0700, to);
         bool made = rc == 0;
@@ -145,7 +132,7 @@ private:
             if (::fstatat(dstDir, dstName, &existing, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(existing.st_mode)) rc = 0;
         }
         if (rc) return fail(rc, to);
-        Fd dst(::openat(dstDir, dstName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        UniqueFd dst(::openat(dstDir, dstName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
         if (dst.get() < 0) return fail(errno, to);
         bool strip = stripInheritedAcl_;
         stripInheritedAcl_ = false;
@@ -186,7 +173,7 @@ private:
         // Links carry no mode, no ACL and (here) no extended attributes worth keeping.
         if (euid_ == 0 && (rc = durable::changeOwnerAt(dstDir, dstName, st.st_uid, st.st_gid, to))) return fail(rc, to);
         if (!S_ISLNK(st.st_mode)) {
-            Fd node(::openat(dstDir, dstName, O_PATH | O_NOFOLLOW | O_CLOEXEC));
+            UniqueFd node(::openat(dstDir, dstName, O_PATH | O_NOFOLLOW | O_CLOEXEC));
             if (node.get() < 0) return fail(errno, to);
             if ((rc = durable::changeModeOfNode(node.get(), to, st.st_mode & 07777))) return fail(rc, to);
             if (stripInheritedAcl_ && (rc = removeAclXattr(node.get(), kAccessAclName, to))) return fail(rc, to);

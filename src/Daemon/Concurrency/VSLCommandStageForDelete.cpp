@@ -106,19 +106,17 @@ bool VSLCommandStageForDelete::stageAll(const std::shared_ptr<VSLCommandQueue>& 
 
 bool VSLCommandStageForDelete::fromQueue(const std::shared_ptr<VSLCommandQueue>& queue, uint64_t* code) {
     VSLErrorRef pending;
-    bool locked = false;
     bool ok = false;
-    try {
-        if (useLocking_) {
-            lock_all_identifiers_for_writing();
-            locked = true;
+    {
+        VSLGlobalLockGuard lock(useLocking_);
+        try {
+            lock.write();
+            ok = stageAll(queue, &pending);
+        } catch (...) {
+            pending = errorForCaughtException("-[VSLCommandStageForDelete fromQueue:executeWithError:]", __LINE__);
+            ok = false;
         }
-        ok = stageAll(queue, &pending);
-    } catch (...) {
-        pending = errorForCaughtException("-[VSLCommandStageForDelete fromQueue:executeWithError:]", __LINE__);
-        ok = false;
     }
-    if (locked) unlock_all_identifiers();
     if (pending) {
         uint64_t failure = codeForError(pending, kVSLErrorDeleteContainer);
         if (onError_) onError_(failure);

@@ -12,6 +12,7 @@
 #include <cstdint>
 #include <initializer_list>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace vsl {
@@ -48,6 +49,58 @@ void lock_all_identifiers_for_reading();
 void lock_all_identifiers_for_writing();
 // Releases the caller's global lock, whatever its mode.
 void unlock_all_identifiers();
+
+// Holds the global lock until release or scope end. With `use` false it takes nothing:
+// for work already running under the global write lock.
+class VSLGlobalLockGuard {
+public:
+    explicit VSLGlobalLockGuard(bool use = true) : use_(use) {}
+    ~VSLGlobalLockGuard() { release(); }
+    VSLGlobalLockGuard(const VSLGlobalLockGuard&) = delete;
+    VSLGlobalLockGuard& operator=(const VSLGlobalLockGuard&) = delete;
+    void read() {
+        if (use_ && !held_) {
+            lock_all_identifiers_for_reading();
+            held_ = true;
+        }
+    }
+    void write() {
+        if (use_ && !held_) {
+            lock_all_identifiers_for_writing();
+            held_ = true;
+        }
+    }
+    void release() {
+        if (held_) unlock_all_identifiers();
+        held_ = false;
+    }
+
+private:
+    bool use_;
+    bool held_ = false;
+};
+
+// Holds identifier locks (ascending order, each once) until scope end.
+class VSLIdentifierLockGuard {
+public:
+    VSLIdentifierLockGuard(std::vector<std::string> identifiers, bool forWriting, bool use = true)
+        : identifiers_(std::move(identifiers)), held_(use) {
+        if (!held_) return;
+        if (forWriting)
+            lock_identifier_for_writing(identifiers_);
+        else
+            lock_identifier_for_reading(identifiers_);
+    }
+    ~VSLIdentifierLockGuard() {
+        if (held_) unlock_identifier(identifiers_);
+    }
+    VSLIdentifierLockGuard(const VSLIdentifierLockGuard&) = delete;
+    VSLIdentifierLockGuard& operator=(const VSLIdentifierLockGuard&) = delete;
+
+private:
+    std::vector<std::string> identifiers_;
+    bool held_;
+};
 
 // A consistent view of the bookkeeping, for tests and diagnostics.
 struct VSLLocksState {

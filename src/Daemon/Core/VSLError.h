@@ -67,6 +67,12 @@ VSLErrorRef createPOSIXError(const char* function, int line, int err, const char
 // other domain maps to `fallback`.
 uint64_t codeForError(const VSLErrorRef& error, uint64_t fallback);
 
+// Whether `error` is present, of `domain` and carries `code`.
+inline bool errorHasCode(const VSLErrorRef& error, int64_t code, const char* domain = VSLErrorDomain) {
+    return error && error->code == code && error->domain == domain;
+}
+inline bool isPOSIXError(const VSLErrorRef& error, int err) { return errorHasCode(error, err, VSLPOSIXErrorDomain); }
+
 }  // namespace vsl
 
 #define VSL_ERROR(code, underlying, log, ...) \

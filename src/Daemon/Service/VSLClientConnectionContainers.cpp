@@ -28,34 +28,7 @@ const char* const kCreateFn =
 constexpr uid_t kSystemSubdirectoryOwner = 4294967294u;  // the 32-bit pattern of -2
 constexpr uid_t kBundleOwner = 33;
 
-// Releases the global lock on every way out.
-class GlobalLock {
-public:
-    explicit GlobalLock(bool use) : use_(use) {}
-    ~GlobalLock() { release(); }
-    void read() {
-        if (use_) {
-            lock_all_identifiers_for_reading();
-            held_ = true;
-        }
-    }
-    void write() {
-        if (use_) {
-            lock_all_identifiers_for_writing();
-            held_ = true;
-        }
-    }
-    void release() {
-        if (held_) unlock_all_identifiers();
-        held_ = false;
-    }
-
-private:
-    bool use_;
-    bool held_ = false;
-};
-
-bool isNotFound(const VSLErrorRef& e) { return e && e->isVSLDomain() && e->code == kVSLErrorNotFound; }
+bool isNotFound(const VSLErrorRef& e) { return errorHasCode(e, kVSLErrorNotFound); }
 
 // The cache shares its records between requests: "existed" belongs to this call only.
 VSLMetadataRef foundRecord(const VSLMetadataRef& cached) {
@@ -173,7 +146,7 @@ VSLMetadataRef VSLClientConnection::createOrLookupContainerWithContainerIdentity
         }
         auto cache = VSLContainerCache::sharedInstance();
         bool allowKernelLookup = !(clientIdentity_ && clientIdentity_->kernel());
-        GlobalLock lock(useLocking);
+        VSLGlobalLockGuard lock(useLocking);
 
         if (!transient) {
             lock.read();
@@ -299,7 +272,7 @@ std::optional<std::vector<VSLMetadataRef>> VSLClientConnection::containersWithCl
         return std::nullopt;
     }
     VSLErrorRef error;
-    GlobalLock lock(true);
+    VSLGlobalLockGuard lock(true);
     lock.read();
     auto all = VSLContainerCache::sharedInstance()->allContainersForUserIdentity(
         clientIdentity_ ? clientIdentity_->userIdentity() : nullptr, containerClass, transient, false, &error);

@@ -15,7 +15,7 @@ namespace {
 
 bool isNoSuchFile(const VSLErrorRef& error) {
     for (VSLErrorRef e = error; e; e = e->underlyingError)
-        if (e->domain == VSLPOSIXErrorDomain && e->code == ENOENT) return true;
+        if (isPOSIXError(e, ENOENT)) return true;
     return false;
 }
 

@@ -145,7 +145,7 @@ bool VSLFileManager::standardizeAllSystemContainerACLsAtURL(const std::string& u
     VSLErrorRef listError;
     auto items = urlsForItemsInDirectoryAtURL(url, &listError);
     if (!items) {
-        if (listError && listError->domain == VSLPOSIXErrorDomain && listError->code == ENOENT) return true;
+        if (isPOSIXError(listError, ENOENT)) return true;
         LogWrite(kLogLevelError, fn, "Failed to get items at URL%@ : %@", url, listError);
         if (error) *error = listError;
         return false;
