@@ -3,17 +3,18 @@
 #include <dirent.h>
 #include <fcntl.h>
 #include <limits.h>
-#include <sys/inotify.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
 #include <cerrno>
 #include <cstdlib>
 #include <cstring>
 #include <unordered_map>
 
 #include "Platform/IpcPeer.h"
+#include "Platform/FileWatcher.h"
 #include "Platform/Log.h"
 #include "Platform/PropertyList.h"
 #include "Platform/SystemRoot.h"
@@ -23,8 +24,6 @@ namespace vsl {
 namespace {
 
 constexpr off_t kMaxPolicyFile = 1 << 20;
-constexpr uint32_t kWatchMask = IN_CLOSE_WRITE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE |
-                                IN_ATTRIB | IN_DELETE_SELF | IN_MOVE_SELF | IN_ONLYDIR;
 
 void logSkip(const std::string& what, const std::string& why) {
     osLog(LogCategory::CodeSignMapping, OSLogLevel::Error, "code-signing policy: skipping %s: %s",
@@ -118,19 +117,17 @@ CodeSigningInfo infoFromRecord(const CodeSigningRecord& r) {
 
 struct CodeSigningPolicy::State {
     bool loaded = false;
-    int inotifyFd = -1;
-    int watch = -1;
+    uint64_t watchToken = 0;
+    std::atomic<bool> changed{true};  // set by the watcher thread
     std::unordered_map<std::string, CodeSigningRecord> byExecutable;
     std::vector<std::string> order;  // executables in file order, for listings
 };
 
 CodeSigningPolicy::CodeSigningPolicy(std::string directory)
-    : directory_(std::move(directory)), state_(std::make_unique<State>()) {
-    state_->inotifyFd = ::inotify_init1(IN_NONBLOCK | IN_CLOEXEC);
-}
+    : directory_(std::move(directory)), state_(std::make_unique<State>()) {}
 
 CodeSigningPolicy::~CodeSigningPolicy() {
-    if (state_->inotifyFd >= 0) ::close(state_->inotifyFd);
+    if (state_->watchToken) FileWatcher::shared().unwatch(state_->watchToken);
 }
 
 std::string CodeSigningPolicy::defaultDirectory() { return rootedPath("etc/vesseld/code-signatures"); }
@@ -143,44 +140,23 @@ CodeSigningPolicy& CodeSigningPolicy::shared() {
 
 void CodeSigningPolicy::watchLocked() {
     State& s = *state_;
-    if (s.inotifyFd < 0 || s.watch >= 0) return;
-    s.watch = ::inotify_add_watch(s.inotifyFd, directory_.c_str(), kWatchMask);
+    if (s.watchToken) return;
+    s.watchToken = FileWatcher::shared().watch(directory_, "", [changed = &s.changed] { changed->store(true); });
+    if (s.watchToken) s.changed = true;  // whatever happened before the watch
 }
 
 void CodeSigningPolicy::refreshLocked() {
     State& s = *state_;
-    if (!s.loaded) {
-        watchLocked();
-        loadLocked();
-        return;
-    }
-    if (s.watch < 0) {
-        // No directory (or no inotify) yet: look for it on each lookup, a stat only.
-        struct stat st;
-        if (::stat(directory_.c_str(), &st) == 0 || !s.byExecutable.empty()) {
-            watchLocked();
-            loadLocked();
-        }
-        return;
-    }
-    alignas(inotify_event) char buffer[4096];
-    bool changed = false;
-    for (;;) {
-        const ssize_t n = ::read(s.inotifyFd, buffer, sizeof buffer);
-        if (n <= 0) break;
-        changed = true;
-        for (ssize_t at = 0; at < n;) {
-            const auto* ev = reinterpret_cast<const inotify_event*>(buffer + at);
-            // The directory itself went away: watch whatever takes its place.
-            if (ev->mask & (IN_IGNORED | IN_DELETE_SELF | IN_MOVE_SELF)) s.watch = -1;
-            at += static_cast<ssize_t>(sizeof(inotify_event) + ev->len);
-        }
-    }
-    if (!changed) return;
-    if (s.watch >= 0) ::inotify_rm_watch(s.inotifyFd, s.watch);
-    s.watch = -1;
     watchLocked();
-    loadLocked();
+    if (!s.watchToken) {
+        // Not even the parent exists yet: look for the directory on each lookup, a stat only.
+        struct stat st;
+        if (!s.loaded || ::stat(directory_.c_str(), &st) == 0 || !s.byExecutable.empty()) loadLocked();
+        return;
+    }
+    // A policy written just before this lookup counts for it.
+    FileWatcher::shared().sync();
+    if (s.changed.exchange(false)) loadLocked();
 }
 
 void CodeSigningPolicy::loadLocked() {
@@ -245,7 +221,6 @@ void CodeSigningPolicy::loadLocked() {
 
 void CodeSigningPolicy::reload() {
     std::lock_guard lock(mutex_);
-    watchLocked();
     loadLocked();
 }
 

@@ -1,15 +1,13 @@
 #include "Platform/UserManagement.h"
 
 #include <fcntl.h>
-#include <poll.h>
-#include <sys/eventfd.h>
-#include <sys/inotify.h>
 #include <unistd.h>
 
 #include <cerrno>
 #include <cstring>
 #include <mutex>
 
+#include "Platform/FileWatcher.h"
 #include "Platform/Log.h"
 #include "Platform/PropertyList.h"
 #include "Platform/SystemRoot.h"
@@ -162,18 +160,10 @@ struct UserManagement::State {
     PersonaAttributesList lastGood;
     PersonaAttributesList announced;  // what the observers last heard
     std::vector<std::weak_ptr<PersonaListObserver>> observers;
-    int inotifyFd = -1;
-    int stopFd = -1;
-    int directoryWatch = -1;
-    int parentWatch = -1;
+    uint64_t watchToken = 0;  // the shared watcher's, once an observer registered
 
     // Keeps change notifications in the order the reads happened.
     std::mutex announceMutex;
-
-    ~State() {
-        if (inotifyFd >= 0) ::close(inotifyFd);
-        if (stopFd >= 0) ::close(stopFd);
-    }
 
     std::optional<PersonaAttributesList> fetch() {
         std::string error;
@@ -206,63 +196,6 @@ struct UserManagement::State {
         return true;
     }
 
-    // Watches the directory, or its parent until the directory appears. Under mutex.
-    bool lock_addWatches(std::string* error) {
-        const uint32_t fileEvents = IN_CLOSE_WRITE | IN_MOVED_TO | IN_MOVED_FROM | IN_DELETE;
-        for (int attempt = 0; attempt < 2; attempt++) {
-            directoryWatch = inotify_add_watch(inotifyFd, directory.c_str(), fileEvents | IN_ONLYDIR);
-            if (directoryWatch >= 0) return true;
-            if (errno != ENOENT) break;
-            if (parentWatch < 0) {
-                parentWatch = inotify_add_watch(inotifyFd, parentPath(directory).c_str(),
-                                                IN_CREATE | IN_MOVED_TO | IN_ONLYDIR);
-                if (parentWatch < 0) break;
-            } else {
-                return true;  // wait for the directory to be made
-            }
-            // Made between the two calls? Try once more now that the parent is watched.
-        }
-        *error = "cannot watch " + directory + ": " + std::strerror(errno);
-        return false;
-    }
-
-    static void watch(const std::shared_ptr<State>& s) {
-        pollfd fds[2] = {{s->inotifyFd, POLLIN, 0}, {s->stopFd, POLLIN, 0}};
-        alignas(inotify_event) char buf[8192];
-        const std::string directoryName = lastPathComponent(s->directory);
-        for (;;) {
-            if (::poll(fds, 2, -1) < 0) {
-                if (errno == EINTR) continue;
-                return;
-            }
-            if (fds[1].revents) return;
-            ssize_t n = ::read(s->inotifyFd, buf, sizeof buf);
-            if (n <= 0) continue;
-            bool changed = false;
-            for (char* p = buf; p < buf + n;) {
-                auto* ev = reinterpret_cast<inotify_event*>(p);
-                p += sizeof(inotify_event) + ev->len;
-                std::string name = ev->len ? ev->name : "";
-                std::lock_guard g(s->mutex);
-                if (ev->mask & IN_Q_OVERFLOW) {
-                    changed = true;  // events were lost: read the file anyway
-                } else if (ev->wd == s->directoryWatch && (ev->mask & IN_IGNORED)) {
-                    // The directory went away: fall back to waiting for it.
-                    s->directoryWatch = -1;
-                    std::string ignored;
-                    s->lock_addWatches(&ignored);
-                    changed = true;
-                } else if (ev->wd == s->directoryWatch && name == kPersonasFile) {
-                    changed = true;
-                } else if (ev->wd == s->parentWatch && name == directoryName && s->directoryWatch < 0) {
-                    std::string ignored;
-                    s->lock_addWatches(&ignored);
-                    changed = true;  // the file may have been written before the watch
-                }
-            }
-            if (changed) s->reload();
-        }
-    }
 };
 
 std::shared_ptr<UserManagement> UserManagement::create() {
@@ -303,16 +236,7 @@ UserManagement::UserManagement(Passkey, std::string directory) : state_(std::mak
 }
 
 UserManagement::~UserManagement() {
-    if (!watcher_.joinable()) return;
-    uint64_t one = 1;
-    ssize_t ignored = ::write(state_->stopFd, &one, sizeof one);
-    (void)ignored;
-    // The last owner may be an observer released on the watcher thread itself; the
-    // thread keeps the state alive and ends on its own.
-    if (watcher_.get_id() == std::this_thread::get_id())
-        watcher_.detach();
-    else
-        watcher_.join();
+    if (state_->watchToken) FileWatcher::shared().unwatch(state_->watchToken);
 }
 
 std::optional<PersonaAttributes> UserManagement::currentPersona(const PersonaContext& context) {
@@ -346,14 +270,13 @@ PersonaAttributesList UserManagement::allPersonas() {
 std::optional<std::string> UserManagement::registerPersonaListObserver(std::weak_ptr<PersonaListObserver> observer,
                                                                        const std::string& serviceName) {
     std::lock_guard g(state_->mutex);
-    if (!state_->directory.empty() && !watcher_.joinable()) {
-        if (state_->inotifyFd < 0) state_->inotifyFd = inotify_init1(IN_CLOEXEC | IN_NONBLOCK);
-        if (state_->stopFd < 0) state_->stopFd = eventfd(0, EFD_CLOEXEC);
-        if (state_->inotifyFd < 0 || state_->stopFd < 0)
-            return serviceName + ": cannot start the persona watcher: " + std::strerror(errno);
-        std::string error;
-        if (!state_->lock_addWatches(&error)) return serviceName + ": " + error;
-        watcher_ = std::thread([s = state_] { State::watch(s); });
+    if (!state_->directory.empty() && !state_->watchToken) {
+        state_->watchToken = FileWatcher::shared().watch(state_->directory, kPersonasFile,
+                                                         [s = std::weak_ptr<State>(state_)] {
+                                                             if (auto held = s.lock()) held->reload();
+                                                         });
+        if (!state_->watchToken)
+            return serviceName + ": cannot watch " + state_->directory + ": " + std::strerror(errno);
     }
     state_->observers.push_back(std::move(observer));
     return std::nullopt;

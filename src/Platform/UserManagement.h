@@ -25,7 +25,6 @@
 #include <memory>
 #include <optional>
 #include <string>
-#include <thread>
 #include <vector>
 
 namespace vsl {
@@ -101,7 +100,6 @@ public:
 
 private:
     std::shared_ptr<State> state_;
-    std::thread watcher_;
 };
 
 }  // namespace vsl

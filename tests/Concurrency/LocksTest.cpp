@@ -454,5 +454,47 @@ TEST(VSLLocksDeathTest, BrokenInvariantsStopTheProcessNamingTheExpression) {
                  HasSubstr("unlock_identifier: Unknown parameter type!"));
 }
 
+// The global write lock is not re-entrant: a thread that asks again for any container
+// lock while holding it stops with a report instead of waiting for itself forever.
+TEST(VSLLocksDeathTest, TheGlobalWriterTakingAnyLockAgainStops) {
+    GTEST_FLAG_SET(death_test_style, "threadsafe");
+    using testing::HasSubstr;
+    EXPECT_DEATH(
+        {
+            lock_all_identifiers_for_writing();
+            lock_all_identifiers_for_writing();
+        },
+        HasSubstr("checkNotGlobalWriter"));
+    EXPECT_DEATH(
+        {
+            lock_all_identifiers_for_writing();
+            lock_all_identifiers_for_reading();
+        },
+        HasSubstr("checkNotGlobalWriter"));
+    EXPECT_DEATH(
+        {
+            lock_all_identifiers_for_writing();
+            lock_identifier_for_reading(std::string("A"));
+        },
+        HasSubstr("checkNotGlobalWriter"));
+
+    // Released by another thread, as queued work does: the taker may take it again,
+    // and a second taker simply waits its turn.
+    lock_all_identifiers_for_writing();
+    std::thread([] { unlock_all_identifiers(); }).join();
+    lock_all_identifiers_for_writing();
+    std::atomic<bool> secondHolds{false};
+    std::thread second([&] {
+        lock_all_identifiers_for_writing();
+        secondHolds = true;
+        unlock_all_identifiers();
+    });
+    EXPECT_FALSE(secondHolds.load());
+    unlock_all_identifiers();
+    second.join();
+    EXPECT_TRUE(secondHolds.load());
+    EXPECT_EQ(currentVSLLocksState().allReaderWriterState, 0);
+}
+
 }  // namespace
 }  // namespace vsl

@@ -7,6 +7,7 @@
 #include <memory>
 #include <mutex>
 #include <optional>
+#include <thread>
 #include <unordered_map>
 
 #include "Daemon/Core/VSLInvariant.h"
@@ -72,6 +73,7 @@ struct VSLLocksRecord {
     uint32_t identifierWriterCount = 0;
     int32_t allReaderWriterState = 0;
     std::vector<std::unique_ptr<SignpostInterval>> globalHoldIntervals;
+    std::thread::id globalWriter;  // who took the global write lock, while it is held
 };
 
 // Never destroyed: worker threads may still unlock while the process exits.
@@ -81,6 +83,15 @@ constexpr const char* kUuidAttribute = " uuid=%{private, signpost.description:at
 
 const char* modeName(bool forWriting) {
     return forWriting ? "writing" : "reading";
+}
+
+// Debug and test builds: a thread that holds the global write lock and asks for any
+// container lock would wait for itself forever; stop loudly instead. Caller holds
+// gVSLLocks.mutex.
+void checkNotGlobalWriter() {
+#if defined(VESSEL_KILLPOINTS) || !defined(NDEBUG)
+    VSL_INVARIANT(gVSLLocks.allReaderWriterState != -1 || gVSLLocks.globalWriter != std::this_thread::get_id());
+#endif
 }
 
 // Caller holds gVSLLocks.mutex.
@@ -130,6 +141,7 @@ void take_one_lock(const std::string& identifier, bool forWriting) {
     identifier_lock* lockPtr = nullptr;
     {
         std::unique_lock<std::mutex> guard(gVSLLocks.mutex);
+        checkNotGlobalWriter();
         if (forWriting) {
             gVSLLocks.identifierWriterCondition.wait(guard, [] { return gVSLLocks.allReaderWriterState == 0; });
             gVSLLocks.identifierWriterCount++;
@@ -243,9 +255,11 @@ void _lock_identifier(const Value& identifiers, bool forWriting) {
 void _lock_all_identifiers(bool forWriting) {
     LogWrite(kLogLevelDebug, __func__, "Waiting to lock all identifiers for %s", modeName(forWriting));
     std::unique_lock<std::mutex> guard(gVSLLocks.mutex);
+    checkNotGlobalWriter();
     if (forWriting) {
         gVSLLocks.globalWriterCondition.wait(guard, [] { return nothingRegistered(); });
         gVSLLocks.allReaderWriterState = -1;
+        gVSLLocks.globalWriter = std::this_thread::get_id();
         if (auto interval = globalHoldInterval("GlobalWriteLock")) {
             gVSLLocks.globalHoldIntervals.push_back(std::move(interval));
         }
@@ -324,6 +338,7 @@ void unlock_all_identifiers() {
             if (nothingRegistered()) gVSLLocks.globalWriterCondition.notify_one();
         } else {
             gVSLLocks.allReaderWriterState = 0;
+            gVSLLocks.globalWriter = std::thread::id();
             gVSLLocks.globalWriterCondition.notify_one();
             gVSLLocks.globalReaderCondition.notify_all();
             gVSLLocks.identifierWriterCondition.notify_all();
