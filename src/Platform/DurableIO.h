@@ -64,6 +64,19 @@ int removeDefaultACL(int fd, const std::string& path);
 // FS_IOC_SETFLAGS: needs an ordinary (not O_PATH) descriptor.
 int setFlags(int fd, const std::string& path, unsigned flags);
 
+// Directories reached without trusting what a user could have put on the way. The
+// path is walked one component at a time with O_NOFOLLOW. A symbolic link is followed
+// only where nobody but root can have placed it (its directory and every one above it
+// owned by root and not writable by group or others, or sticky with a root-owned link);
+// anywhere else it fails with ELOOP, and a component that is no directory with
+// ENOTDIR. `*fd` comes back as an O_PATH descriptor of the directory, checked with
+// fstat: the f* forms above act on it.
+int openDirectoryNoFollow(const std::string& path, int* fd);
+// The same walk making what is missing: every missing component when `intermediates`,
+// else only the last one. New directories get exactly `mode`, whatever the umask;
+// an existing directory is left as it is and is no error.
+int makeDirectoryNoFollow(const std::string& path, mode_t mode, bool intermediates, int* fd);
+
 // "/proc/self/fd/N": names what `fd` refers to, whatever happened to its path since.
 std::string descriptorPath(int fd);
 

@@ -17,6 +17,9 @@
 
 #include <systemd/sd-journal.h>
 
+#include "Platform/DurableIO.h"
+#include "Platform/UniqueFd.h"
+
 namespace vsl {
 namespace {
 
@@ -61,13 +64,8 @@ FileLog& fileLog() {
 }
 
 bool makeDirectories(const std::string& path) {
-    for (size_t slash = path.find('/', 1);; slash = path.find('/', slash + 1)) {
-        std::string prefix = path.substr(0, slash);
-        if (!prefix.empty() && ::mkdir(prefix.c_str(), 0755) != 0 && errno != EEXIST) return false;
-        if (slash == std::string::npos) break;
-    }
-    struct stat st{};
-    return ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+    UniqueFd dir;
+    return durable::makeDirectoryNoFollow(path, 0755, true, dir.out()) == 0;
 }
 
 bool openLocked(FileLog& log) {

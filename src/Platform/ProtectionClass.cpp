@@ -34,6 +34,9 @@ bool keybagIsLocked() {
 int getProtectionClass(int fd, int* protectionClass) {
     char buf[16];
     ssize_t n = ::fgetxattr(fd, protectionClassAttributeName(), buf, sizeof buf);
+    // An O_PATH descriptor reads no attributes itself; its /proc name reaches the same inode.
+    if (n < 0 && errno == EBADF)
+        n = ::getxattr(durable::descriptorPath(fd).c_str(), protectionClassAttributeName(), buf, sizeof buf);
     if (n < 0) {
         if (errno != ENODATA) return errno;
         *protectionClass = kProtectionClassNone;

@@ -18,7 +18,7 @@ const char* protectionClassAttributeName();
 std::string keybagLockStatePath();
 bool keybagIsLocked();
 
-// `fd` is an ordinary descriptor of the item. Return 0 or an errno value.
+// `fd` is a descriptor of the item (O_PATH is fine). Return 0 or an errno value.
 int getProtectionClass(int fd, int* protectionClass);
 // Writes only when the class differs; `path` names the durable step.
 int setProtectionClass(int fd, const std::string& path, int protectionClass);

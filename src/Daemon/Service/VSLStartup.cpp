@@ -7,6 +7,7 @@
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Service/VSLCommandTable.h"
+#include "Daemon/Storage/VSLGlobalConfiguration.h"
 #include "Platform/CrashAnnotation.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
@@ -24,7 +25,7 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     bool internal = deviceFacts().internalBuild;
 
     LogFileOptions options;
-    options.directory = rootedPath("/private/var/root/Library/Logs/Vesselry");
+    options.directory = VSLGlobalConfiguration::sharedInstance()->logDirectory();
     options.maxBytes = internal ? 262144 : 102400;
     options.rotatedFiles = internal ? 4 : 1;
     if (!openLogFile(options)) {

@@ -19,6 +19,7 @@
 #include "Platform/TreeCopy.h"
 #include "Platform/TreeRemove.h"
 #include "Platform/TreeWalk.h"
+#include "Platform/UniqueFd.h"
 
 namespace vsl {
 
@@ -30,27 +31,6 @@ const char* const kRemoveFunction = "-[VSLFileManager removeItemAtURL:error:]";
 
 void setError(VSLErrorRef* out, VSLErrorRef error) {
     if (out) *out = std::move(error);
-}
-
-// mkdir -p: missing parents get the same mode. The mode is made exact where the
-// umask took bits away, so a layout does not depend on who started the daemon.
-int makeDirectory(const std::string& path, mode_t mode) {
-    int rc = durable::makeDirectory(path, mode);
-    if (rc) return rc;
-    struct stat st;
-    if (::stat(path.c_str(), &st) == 0 && (st.st_mode & 07777) != mode) return durable::changeMode(path, mode);
-    return 0;
-}
-
-int makePath(const std::string& path, mode_t mode) {
-    struct stat st;
-    if (::stat(path.c_str(), &st) == 0) return S_ISDIR(st.st_mode) ? 0 : ENOTDIR;
-    if (errno != ENOENT) return errno;
-    std::string parent = parentPath(path);
-    if (parent != path)
-        if (int rc = makePath(parent, mode)) return rc;
-    int rc = makeDirectory(path, mode);
-    return rc == EEXIST && ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode) ? 0 : rc;
 }
 
 // An item the removal could not unlink because it is immutable: clear the flag and
@@ -102,24 +82,17 @@ std::string VSLFileManager::homeDirectoryURLForPOSIXUID(uid_t uid) {
 bool VSLFileManager::createDirectoryAtURL(const std::string& url, bool withIntermediateDirectories, mode_t mode,
                                           uid_t owner, VSLDataProtectionClass protectionClass,
                                           VSLErrorRef* error) const {
-    int rc = withIntermediateDirectories ? makePath(url, mode) : makeDirectory(url, mode);
-    if (rc == EEXIST) rc = 0;
-    if (rc) {
+    // Class and owner go through the descriptor the walk checked: a link put in place
+    // of any component by a user is refused, never followed.
+    UniqueFd dir;
+    if (int rc = durable::makeDirectoryNoFollow(url, mode, withIntermediateDirectories, dir.out())) {
         setError(error, VSL_POSIX_ERROR(rc, withIntermediateDirectories ? "mkpath_np of %s failed: %s"
                                                                         : "mkdir of %s failed: %s",
                                         url, std::strerror(rc)));
         return false;
     }
     if (protectionClass != kVSLDataProtectionClassUnset) {
-        int fd = ::open(url.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-        if (fd < 0) {
-            int err = errno;
-            setError(error, VSL_POSIX_ERROR(err, "opendir of %s failed: %s", url, std::strerror(err)));
-            return false;
-        }
-        rc = setProtectionClass(fd, url, static_cast<int>(protectionClass));
-        ::close(fd);
-        if (rc) {
+        if (int rc = setProtectionClass(dir.get(), url, static_cast<int>(protectionClass))) {
             setError(error, VSL_POSIX_ERROR(rc, "Failed to setclass(%d) on directory %s: %s",
                                             static_cast<int>(protectionClass), url, std::strerror(rc)));
             return false;
@@ -127,8 +100,9 @@ bool VSLFileManager::createDirectoryAtURL(const std::string& url, bool withInter
     }
     if (owner != 0) {
         struct stat st;
-        rc = ::stat(url.c_str(), &st) != 0 ? errno : 0;
-        if (rc == 0 && (st.st_uid != owner || st.st_gid != owner)) rc = durable::changeOwner(url, owner, owner);
+        int rc = ::fstat(dir.get(), &st) != 0 ? errno : 0;
+        if (rc == 0 && (st.st_uid != owner || st.st_gid != owner))
+            rc = durable::changeOwnerOfNode(dir.get(), url, owner, owner);
         if (rc) {
             setError(error, VSL_POSIX_ERROR(rc, "Failed to chown(%d,%d) %s: %s", static_cast<int>(owner),
                                             static_cast<int>(owner), url, std::strerror(rc)));
@@ -151,6 +125,15 @@ bool VSLFileManager::createDirectoryAtURL(const std::string& url, bool withInter
 bool VSLFileManager::createDirectoryAtURL(const std::string& url, bool withIntermediateDirectories, mode_t mode,
                                           VSLErrorRef* error) const {
     return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0, kVSLDataProtectionClassUnset, error);
+}
+
+bool VSLFileManager::directoryIsReachableWithoutLinksAtURL(const std::string& url, VSLErrorRef* error) const {
+    UniqueFd dir;
+    if (int rc = durable::openDirectoryNoFollow(url, dir.out())) {
+        setError(error, VSL_POSIX_ERROR(rc, "opendir of %s failed: %s", url, std::strerror(rc)));
+        return false;
+    }
+    return true;
 }
 
 // ---- move and copy ----
