@@ -15,27 +15,33 @@
 #include <mutex>
 
 #include "Platform/SystemRoot.h"
+#include "Platform/UniqueFd.h"
 #include "Platform/Value.h"
 
 namespace vsl::durable {
 
 namespace {
+#ifdef VESSEL_KILLPOINTS
 std::atomic<uint64_t> gSteps{0};
 
-#ifdef VESSEL_KILLPOINTS
 struct KillConfig {
     uint64_t killAt = 0;
     std::string traceFile;
+    std::string dropFsync;  // "item" or "parent": a fault the rename audit must catch
 };
 const KillConfig& killConfig() {
     static const KillConfig c = [] {
         KillConfig k;
         if (const char* s = std::getenv("VESSELD_KILL_AT")) k.killAt = std::strtoull(s, nullptr, 10);
         if (const char* s = std::getenv("VESSELD_DURABLE_TRACE")) k.traceFile = s;
+        if (const char* s = std::getenv("VESSELD_TEST_DROP_FSYNC")) k.dropFsync = s;
         return k;
     }();
     return c;
 }
+bool dropsFsync(const char* which) { return killConfig().dropFsync == which; }
+#else
+constexpr bool dropsFsync(const char*) { return false; }
 #endif
 
 int writeAllAndSync(int fd, const void* data, size_t length) {
@@ -86,9 +92,9 @@ int copyByReadWrite(int from, int to) {
 
 std::string descriptorPath(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
+#ifdef VESSEL_KILLPOINTS
 void step(const char* kind, const std::string& path) {
     uint64_t n = ++gSteps;
-#ifdef VESSEL_KILLPOINTS
     const KillConfig& k = killConfig();
     if (!k.traceFile.empty()) {
         static std::mutex traceMutex;
@@ -99,13 +105,10 @@ void step(const char* kind, const std::string& path) {
         }
     }
     if (k.killAt != 0 && n == k.killAt) ::_exit(86);
-#else
-    (void)kind;
-    (void)path;
-#endif
 }
 
 uint64_t stepCount() { return gSteps.load(); }
+#endif
 
 int makeDirectory(const std::string& path, mode_t mode) {
     step("mkdir", path);
@@ -113,12 +116,12 @@ int makeDirectory(const std::string& path, mode_t mode) {
 }
 
 int renamePath(const std::string& from, const std::string& to) {
-    step("rename", to);
+    step("rename", from + " -> " + to);
     return result(::rename(from.c_str(), to.c_str()));
 }
 
 int renameNoReplace(const std::string& from, const std::string& to) {
-    step("rename", to);
+    step("rename", from + " -> " + to);
     return result(::renameat2(AT_FDCWD, from.c_str(), AT_FDCWD, to.c_str(), RENAME_NOREPLACE));
 }
 
@@ -143,6 +146,50 @@ int fsyncPath(const std::string& path) {
 
 int fsyncParent(const std::string& path) { return fsyncPath(parentPath(path)); }
 
+int fsyncDescriptor(int fd, const std::string& path) {
+    step("fsync", path);
+    return result(::fsync(fd));
+}
+
+namespace {
+int openDirectory(const std::string& path, UniqueFd* fd, struct stat* st) {
+    fd->reset(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    if (!fd->valid()) return errno;
+    return result(::fstat(fd->get(), st));
+}
+
+// A directory's entries reach the disk only with an fsync of the directory; a file's
+// writer syncs its data itself (writeFile), and links and special files hold none.
+int syncMovedItem(int dirfd, const std::string& name, const std::string& path) {
+    UniqueFd node(::openat(dirfd, name.c_str(), O_PATH | O_NOFOLLOW | O_CLOEXEC));
+    if (!node.valid()) return errno == ENOENT ? 0 : errno;  // the rename reports a missing source
+    struct stat st;
+    if (::fstat(node.get(), &st) != 0) return errno;
+    if (!S_ISDIR(st.st_mode) || dropsFsync("item")) return 0;
+    UniqueFd dir(::open(descriptorPath(node.get()).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+    if (!dir.valid()) return errno;
+    return fsyncDescriptor(dir.get(), path);
+}
+
+int renameAndSync(const std::string& from, const std::string& to, bool syncItem) {
+    UniqueFd fromDir, toDir;
+    struct stat fromSt, toSt;
+    if (int rc = openDirectory(parentPath(from), &fromDir, &fromSt)) return rc;
+    if (int rc = openDirectory(parentPath(to), &toDir, &toSt)) return rc;
+    std::string fromName = lastPathComponent(from), toName = lastPathComponent(to);
+    if (syncItem)
+        if (int rc = syncMovedItem(fromDir.get(), fromName, from)) return rc;
+    step("rename", from + " -> " + to);
+    if (::renameat(fromDir.get(), fromName.c_str(), toDir.get(), toName.c_str()) != 0) return errno;
+    if (int rc = fsyncDescriptor(toDir.get(), parentPath(to))) return rc;
+    bool sameDirectory = fromSt.st_dev == toSt.st_dev && fromSt.st_ino == toSt.st_ino;
+    if (sameDirectory || dropsFsync("parent")) return 0;
+    return fsyncDescriptor(fromDir.get(), parentPath(from));
+}
+}  // namespace
+
+int renameDurably(const std::string& from, const std::string& to) { return renameAndSync(from, to, true); }
+
 int writeFile(const std::string& path, const void* data, size_t length, mode_t mode) {
     step("write", path);
     int fd = ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC | O_NOFOLLOW, mode);
@@ -160,11 +207,9 @@ int writeFileAtomically(const std::string& path, const void* data, size_t length
     name += Uuid::random().string();
     std::string temp = joinPath(parentPath(path), name);
     if (int rc = writeFile(temp, data, length, mode)) return rc;
-    if (int rc = renamePath(temp, path)) {
-        ::unlink(temp.c_str());
-        return rc;
-    }
-    return fsyncParent(path);
+    int rc = renameAndSync(temp, path, false);  // writeFile synced the data
+    if (rc) ::unlink(temp.c_str());
+    return rc;
 }
 
 int makeTemporaryDirectory(std::string* templ) {

@@ -2,8 +2,8 @@
 // unlink, rmdir, file write, fsync, owner/mode/ACL/flag/xattr change) passes
 // through here so that crash tests can count them: in builds with
 // VESSEL_KILLPOINTS, VESSELD_KILL_AT=N exits with status 86 just before the Nth step
-// and VESSELD_DURABLE_TRACE=FILE appends "<n> <kind> <path>" for each.
-// Functions return 0 or an errno value.
+// and VESSELD_DURABLE_TRACE=FILE appends "<n> <kind> <path>" for each (the path of a
+// rename is "<from> -> <to>"). Functions return 0 or an errno value.
 #pragma once
 
 #include <sys/acl.h>
@@ -16,16 +16,31 @@
 
 namespace vsl::durable {
 
+#ifdef VESSEL_KILLPOINTS
 void step(const char* kind, const std::string& path);
 uint64_t stepCount();
+#else
+inline void step(const char*, const std::string&) {}  // release builds count nothing
+#endif
 
 int makeDirectory(const std::string& path, mode_t mode);
+// Bare renames, for files that need not survive a power cut (under run/); anything
+// else moves with renameDurably.
 int renamePath(const std::string& from, const std::string& to);
 int renameNoReplace(const std::string& from, const std::string& to);
 int removeFile(const std::string& path);
 int removeDirectory(const std::string& path);
 int fsyncPath(const std::string& path);  // file or directory
 int fsyncParent(const std::string& path);
+int fsyncDescriptor(int fd, const std::string& path);
+// The one durable move of a tree or file: fsync of the item itself (a directory or a
+// regular file; links and special files carry nothing to flush), the rename, then
+// fsync of the destination's and the source's directories, so that after a power cut
+// the item is in exactly one of the two places, whole. The directories are opened
+// without following a final link and the rename is made relative to them, so the
+// fsyncs reach the directories that changed. EXDEV is returned untouched for the
+// caller's copy.
+int renameDurably(const std::string& from, const std::string& to);
 
 // Creates or truncates `path`, writes all bytes and fsyncs the file.
 int writeFile(const std::string& path, const void* data, size_t length, mode_t mode);

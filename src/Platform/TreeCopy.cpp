@@ -11,6 +11,7 @@
 #include <cstring>
 #include <vector>
 
+#include "Platform/DirectoryCursor.h"
 #include "Platform/DirectoryEntries.h"
 #include "Platform/DurableIO.h"
 #include "Platform/UniqueFd.h"
@@ -42,8 +43,8 @@ bool isWithin(const std::string& path, const std::string& tree) {
 
 class TreeCopier {
 public:
-    explicit TreeCopier(std::string* failedPath)
-        : failedPath_(failedPath), euid_(::geteuid()), egid_(::getegid()), umask_(processUmask()) {}
+    TreeCopier(std::string* failedPath, CopySync sync)
+        : failedPath_(failedPath), sync_(sync), euid_(::geteuid()), egid_(::getegid()), umask_(processUmask()) {}
 
     int copyTop(const std::string& from, const std::string& to) {
         UniqueFd srcDir(::open(parentPath(from).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
@@ -60,10 +61,21 @@ public:
         stripInheritedAcl_ = ::fgetxattr(dstDir.get(), kDefaultAclName, &probe, 0) > 0;
         // What is made in the caller's directory may take its group or ACL; below, only
         // what this copy made holds the new items.
-        return copyEntry(srcDir.get(), srcName.c_str(), st, dstDir.get(), dstName.c_str(), from, to, false);
+        DirectoryCursor src(srcDir.get()), dst(dstDir.get());
+        return copyEntry(src, srcName.c_str(), st, dst, dstName.c_str(), from, to, false);
     }
 
 private:
+    // One directory being copied: the cursors stand in it (source and copy) while its
+    // entries are worked through.
+    struct Level {
+        struct stat st;
+        std::string from, to;
+        bool made, parentIsOurs, childrenOurs, strip;
+        std::vector<DirectoryEntry> entries;
+        size_t next = 0;
+    };
+
     int fail(int err, const std::string& path) {
         if (failedPath_) *failedPath_ = path;
         return err;
@@ -81,11 +93,34 @@ private:
         return mask;
     }
 
-    // `parentIsOurs`: `dstDir` was made by this copy, so a new item in it is owned by
-    // this process and gets its mode from the umask alone.
-    int copyEntry(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
-                  const std::string& from, const std::string& to, bool parentIsOurs) {
-        if (S_ISDIR(st.st_mode)) return copyDirectory(srcDir, srcName, st, dstDir, dstName, from, to, parentIsOurs);
+    // `parentIsOurs`: the destination directory was made by this copy, so a new item in
+    // it is owned by this process and gets its mode from the umask alone. A directory
+    // is copied depth first without recursion, the cursors holding one descriptor each.
+    int copyEntry(DirectoryCursor& src, const char* srcName, const struct stat& st, DirectoryCursor& dst,
+                  const char* dstName, const std::string& from, const std::string& to, bool parentIsOurs) {
+        if (!S_ISDIR(st.st_mode)) return copyNonDirectory(src.fd(), srcName, st, dst.fd(), dstName, from, to, parentIsOurs);
+        if (int rc = enterDirectory(src, srcName, st, dst, dstName, from, to, parentIsOurs)) return rc;
+        while (!levels_.empty()) {
+            Level& level = levels_.back();
+            if (level.next == level.entries.size()) {
+                if (int rc = leaveDirectory(src, dst)) return rc;
+                continue;
+            }
+            std::string name = level.entries[level.next++].name;  // levels_ may grow below
+            std::string childFrom = joinPath(level.from, name), childTo = joinPath(level.to, name);
+            struct stat child;
+            if (::fstatat(src.fd(), name.c_str(), &child, AT_SYMLINK_NOFOLLOW) != 0) return fail(errno, childFrom);
+            bool ours = level.childrenOurs;
+            int rc = S_ISDIR(child.st_mode)
+                         ? enterDirectory(src, name.c_str(), child, dst, name.c_str(), childFrom, childTo, ours)
+                         : copyNonDirectory(src.fd(), name.c_str(), child, dst.fd(), name.c_str(), childFrom, childTo, ours);
+            if (rc) return rc;
+        }
+        return 0;
+    }
+
+    int copyNonDirectory(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
+                         const std::string& from, const std::string& to, bool parentIsOurs) {
         if (S_ISREG(st.st_mode)) return copyFile(srcDir, srcName, st, dstDir, dstName, from, to, parentIsOurs);
         return copySpecial(srcDir, srcName, st, dstDir, dstName, from, to);
     }
@@ -108,8 +143,14 @@ private:
 
     int copyFile(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
                  const std::string& from, const std::string& to, bool parentIsOurs) {
-        UniqueFd src(::openat(srcDir, srcName, O_RDONLY | O_NOFOLLOW | O_CLOEXEC));
+        // Non-blocking, and checked to be the file listed: a FIFO or device swapped in
+        // since would block the copy or be read for the file.
+        UniqueFd src(::openat(srcDir, srcName, O_RDONLY | O_NOFOLLOW | O_NONBLOCK | O_CLOEXEC));
         if (src.get() < 0) return fail(errno, from);
+        struct stat opened;
+        if (::fstat(src.get(), &opened) != 0) return fail(errno, from);
+        if (!S_ISREG(opened.st_mode) || opened.st_dev != st.st_dev || opened.st_ino != st.st_ino)
+            return fail(ESTALE, from);
         mode_t mode = st.st_mode & 07777;
         // Born with its final mode when nothing (umask, set-id bits) can change it.
         bool exact = parentIsOurs && umask_ >= 0 && (mode & 07000) == 0 && (mode & ~static_cast<mode_t>(umask_)) == mode;
@@ -117,43 +158,48 @@ private:
         int rc = makeReplacing(dstDir, dstName, to,
                                [&] { return durable::createFileAt(dstDir, dstName, exact ? mode : 0600, to, dst.out()); });
         if (rc) return fail(rc, to);
-        if ((rc = durable::copyFileData(src.get(), dst.get(), st.st_size, to, &method_))) return fail(rc, to);
-        return copyAttributes(src.get(), dst.get(), st, to, ownerMatches(st, parentIsOurs), exact);
+        if ((rc = durable::copyFileData(src.get(), dst.get(), opened.st_size, to, &method_))) return fail(rc, to);
+        if ((rc = copyAttributes(src.get(), dst.get(), st, to, ownerMatches(st, parentIsOurs), exact))) return rc;
+        if (sync_ == CopySync::EachItem && (rc = durable::fsyncDescriptor(dst.get(), to))) return fail(rc, to);
+        return 0;
     }
 
-    int copyDirectory(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
-                      const std::string& from, const std::string& to, bool parentIsOurs) {
-        UniqueFd src(::openat(srcDir, srcName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-        if (src.get() < 0) return fail(errno, from);
-        int rc = durable::makeDirectoryAt(dstDir, dstName, 0700, to);
+    // Makes the copy of a directory and steps both cursors into it.
+    int enterDirectory(DirectoryCursor& src, const char* srcName, const struct stat& st, DirectoryCursor& dst,
+                       const char* dstName, const std::string& from, const std::string& to, bool parentIsOurs) {
+        if (int rc = src.descend(srcName, &st)) return fail(rc, from);
+        int rc = durable::makeDirectoryAt(dst.fd(), dstName, 0700, to);
         bool made = rc == 0;
         if (rc == EEXIST) {
             struct stat existing;
-            if (::fstatat(dstDir, dstName, &existing, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(existing.st_mode)) rc = 0;
+            if (::fstatat(dst.fd(), dstName, &existing, AT_SYMLINK_NOFOLLOW) == 0 && S_ISDIR(existing.st_mode)) rc = 0;
         }
         if (rc) return fail(rc, to);
-        UniqueFd dst(::openat(dstDir, dstName, O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
-        if (dst.get() < 0) return fail(errno, to);
-        bool strip = stripInheritedAcl_;
+        struct stat madeStat;
+        if ((rc = dst.descend(dstName, nullptr, &madeStat))) return fail(rc, to);
+        Level level{st, from, to, made, parentIsOurs, false, stripInheritedAcl_, {}, 0};
         stripInheritedAcl_ = false;
         // An inherited default ACL must go before the contents are made, or they inherit it.
-        if (strip && (rc = removeAclXattr(dst.get(), kDefaultAclName, to))) return fail(rc, to);
+        if (level.strip && (rc = removeAclXattr(dst.fd(), kDefaultAclName, to))) return fail(rc, to);
         // A set-group-id directory (inherited from the caller's) hands its group on.
-        struct stat madeStat;
-        bool childrenOurs = made && ::fstat(dst.get(), &madeStat) == 0 && !(madeStat.st_mode & S_ISGID);
+        level.childrenOurs = made && !(madeStat.st_mode & S_ISGID);
+        if ((rc = readDirectoryEntries(src.fd(), &level.entries))) return fail(rc, from);
+        levels_.push_back(std::move(level));
+        return 0;
+    }
 
-        std::vector<DirectoryEntry> entries;
-        if ((rc = readDirectoryEntries(src.get(), &entries))) return fail(rc, from);
-        for (const DirectoryEntry& e : entries) {
-            struct stat child;
-            if (::fstatat(src.get(), e.name.c_str(), &child, AT_SYMLINK_NOFOLLOW) != 0)
-                return fail(errno, joinPath(from, e.name));
-            if ((rc = copyEntry(src.get(), e.name.c_str(), child, dst.get(), e.name.c_str(), joinPath(from, e.name),
-                                joinPath(to, e.name), childrenOurs)))
-                return rc;
-        }
-        stripInheritedAcl_ = strip;
-        return copyAttributes(src.get(), dst.get(), st, to, made && ownerMatches(st, parentIsOurs), false);
+    // The directory's contents are done: its own attributes (times last), then back up.
+    int leaveDirectory(DirectoryCursor& src, DirectoryCursor& dst) {
+        Level level = std::move(levels_.back());
+        levels_.pop_back();
+        stripInheritedAcl_ = level.strip;
+        int rc = copyAttributes(src.fd(), dst.fd(), level.st, level.to,
+                                level.made && ownerMatches(level.st, level.parentIsOurs), false);
+        if (rc) return rc;
+        if (sync_ == CopySync::EachItem && (rc = durable::fsyncDescriptor(dst.fd(), level.to))) return fail(rc, level.to);
+        if ((rc = src.ascend())) return fail(rc, level.from);
+        if ((rc = dst.ascend())) return fail(rc, level.to);
+        return 0;
     }
 
     int copySpecial(int srcDir, const char* srcName, const struct stat& st, int dstDir, const char* dstName,
@@ -232,6 +278,8 @@ private:
     }
 
     std::string* failedPath_;
+    CopySync sync_;
+    std::vector<Level> levels_;
     uid_t euid_;
     gid_t egid_;
     int umask_;
@@ -241,8 +289,8 @@ private:
 
 }  // namespace
 
-int copyTree(const std::string& from, const std::string& to, std::string* failedPath) {
-    return TreeCopier(failedPath).copyTop(from, to);
+int copyTree(const std::string& from, const std::string& to, std::string* failedPath, CopySync sync) {
+    return TreeCopier(failedPath, sync).copyTop(from, to);
 }
 
 }  // namespace vsl

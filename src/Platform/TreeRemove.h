@@ -1,8 +1,8 @@
 // Recursive removal that follows no symbolic link and keeps going past items it
 // cannot remove: each failure goes to a callback, which may repair and retry the
-// item itself (for example clear an immutable flag). Works relative to descriptors
-// of the directories on the way, so a link swapped into the tree cannot send it
-// outside.
+// item itself (for example clear an immutable flag). Works relative to the descriptor
+// of the directory it is in (one at any depth, see DirectoryCursor), so a link
+// swapped into the tree cannot send it outside and no depth runs out of descriptors.
 #pragma once
 
 #include <functional>

@@ -3,6 +3,7 @@
 #include <fcntl.h>
 #include <poll.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -114,6 +115,8 @@ bool DaemonProcess::start(const std::vector<std::string>& extraEnvironment) {
             ::dup2(fd, 1);
             ::dup2(fd, 2);
         }
+        struct rlimit files = {descriptorLimit_, descriptorLimit_};
+        if (descriptorLimit_ != 0 && ::setrlimit(RLIMIT_NOFILE, &files) != 0) ::_exit(126);
         ::execve(cargv[0], cargv.data(), cenv.data());
         ::_exit(127);
     }

@@ -30,6 +30,8 @@ public:
 
     // Starts vesseld --root ROOT --init and waits until it answers. False on failure.
     bool start(const std::vector<std::string>& extraEnvironment = {});
+    // Soft and hard RLIMIT_NOFILE of the daemons started from now on (0: inherited).
+    void setDescriptorLimit(unsigned long limit) { descriptorLimit_ = limit; }
     // SIGTERM and wait; returns the exit status (or -1).
     int stop();
     // SIGKILL and reap.
@@ -56,6 +58,7 @@ public:
 private:
     std::string root_;
     pid_t pid_ = -1;
+    unsigned long descriptorLimit_ = 0;
 };
 
 // Runs a program, capturing stdout and stderr; returns the exit status.

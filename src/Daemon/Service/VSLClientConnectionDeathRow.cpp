@@ -1,12 +1,14 @@
 // Death row: deleting is a rename into "Dead" while a client waits; the removal
 // itself happens later, in the background, without any container lock.
 #include <cerrno>
+#include <cstring>
 
 #include "Daemon/Core/VSLDispatch.h"
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Storage/VSLFileManager.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
+#include "Platform/DurableIO.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {
@@ -32,6 +34,13 @@ bool VSLClientConnection::_moveItemAtURLToDeathRow(const std::string& url, bool 
     std::string deathRow = VSLGlobalConfiguration::sharedInstance()->deathrowDirectory();
     VSLErrorRef underlying;
     auto unique = fm.createTemporaryDirectoryInDirectoryURL(deathRow, "temp.", &underlying);
+    // The new directory's entry must be on disk before the item moves into it: the move
+    // syncs only the directory it lands in and the one it left.
+    if (unique)
+        if (int rc = durable::fsyncParent(*unique)) {
+            underlying = VSL_POSIX_ERROR(rc, "fsync of %@ failed: %s", deathRow, std::strerror(rc));
+            unique.reset();
+        }
     if (!unique) {
         if (error) *error = VSL_ERROR(kVSLErrorMoveToDeathRow, underlying, true, "Failed to create unique directory at: %@", url);
         return false;

@@ -157,17 +157,32 @@ bool VSLFileManager::_moveItemAtURL(const std::string& from, const std::string& 
                                     VSLErrorRef* error) const {
     bool failed = false;
     if (sourceMissing(from, failIfSrcMissing, error, &failed)) return !failed;
-    int rc = durable::renamePath(from, to);
+    int rc = durable::renameDurably(from, to);
     if (rc == 0) return true;
     if (rc != EXDEV) {
         setError(error, VSL_POSIX_ERROR(rc, "rename of %@ to %@ failed: %s", from, to, std::strerror(rc)));
         return false;
     }
-    if (!_copyItemAtURL(from, to, true, error)) return false;
+    // Across devices: a synced copy, then the source goes. A copy that fails halfway
+    // is removed, or it would pass for the item.
+    struct stat st;
+    bool destinationExisted = ::lstat(to.c_str(), &st) == 0;
+    rc = copyTree(from, to, nullptr, CopySync::EachItem);
+    if (rc == 0) rc = durable::fsyncParent(to);
+    if (rc) {
+        VSLErrorRef cleanUpError;
+        if (!destinationExisted && !removeItemAtURL(to, &cleanUpError))
+            LogWrite(kLogLevelError, "-[VSLFileManager _moveItemAtURL:toURL:failIfSrcMissing:error:]",
+                     "Failed to remove partial copy at %@ : %@", to, cleanUpError);
+        setError(error, VSL_POSIX_ERROR(rc, "copyfile of %@ to %@ failed: %s", from, to, std::strerror(rc)));
+        return false;
+    }
     VSLErrorRef removeError;
     if (!removeItemAtURL(from, &removeError))
         LogWrite(kLogLevelError, "-[VSLFileManager _moveItemAtURL:toURL:failIfSrcMissing:error:]",
                  "Failed to remove move source after copy at %@ : %@", from, removeError);
+    else
+        durable::fsyncParent(from);  // best effort: a source back after a power cut is a duplicate, not a loss
     return true;
 }
 

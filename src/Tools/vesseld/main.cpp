@@ -4,6 +4,7 @@
 // configuration there so the daemon runs without privileges or set-up.
 #include <pthread.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -65,6 +66,12 @@ int main(int argc, char** argv) {
         }
     }
     signal(SIGPIPE, SIG_IGN);
+    // Connections and tree walks draw on one descriptor table: take all the hard limit allows.
+    struct rlimit files;
+    if (::getrlimit(RLIMIT_NOFILE, &files) == 0 && files.rlim_cur < files.rlim_max) {
+        files.rlim_cur = files.rlim_max;
+        ::setrlimit(RLIMIT_NOFILE, &files);
+    }
     if (init && ::mkdir(root.c_str(), 0755) != 0 && errno != EEXIST) {
         std::fprintf(stderr, "vesseld: cannot create %s: %s\n", root.c_str(), std::strerror(errno));
         return 1;
