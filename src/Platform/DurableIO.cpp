@@ -152,8 +152,13 @@ int fsyncDescriptor(int fd, const std::string& path) {
 }
 
 namespace {
+// Both ends of a move are reached by the directory walk: a link that a user put in
+// place of any component is refused, not followed (so a container never lands in a
+// directory the user chose).
 int openDirectory(const std::string& path, UniqueFd* fd, struct stat* st) {
-    fd->reset(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+    UniqueFd pinned;
+    if (int rc = openDirectoryNoFollow(path, pinned.out())) return rc;
+    fd->reset(::open(descriptorPath(pinned.get()).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (!fd->valid()) return errno;
     return result(::fstat(fd->get(), st));
 }

@@ -248,10 +248,6 @@ VSLMetadataRef VSLClientConnection::createContainer(const VSLContainerIdentityRe
     if (!classDirectory) return cleanUp(VSL_ERROR(kVSLErrorUnexpectedClass, nullptr, true,
                                                   "Passed an unexpected container type: %llu", c));
     std::string live = joinPath(*classDirectory, wellKnown.value_or(directoryName));
-    // A class directory that a user swapped for a link is refused, not moved into.
-    if (!fm.directoryIsReachableWithoutLinksAtURL(*classDirectory, &underlying))
-        return cleanUp(VSL_ERROR(kVSLErrorMoveStagingDir, underlying, true,
-                                 "Failed to move staging dir: %@ to live dir: %@", staging, live));
     if (!fm.moveItemAtURL(staging, live, &underlying))
         return cleanUp(VSL_ERROR(kVSLErrorMoveStagingDir, underlying, true,
                                  "Failed to move staging dir: %@ to live dir: %@", staging, live));

@@ -127,15 +127,6 @@ bool VSLFileManager::createDirectoryAtURL(const std::string& url, bool withInter
     return createDirectoryAtURL(url, withIntermediateDirectories, mode, 0, kVSLDataProtectionClassUnset, error);
 }
 
-bool VSLFileManager::directoryIsReachableWithoutLinksAtURL(const std::string& url, VSLErrorRef* error) const {
-    UniqueFd dir;
-    if (int rc = durable::openDirectoryNoFollow(url, dir.out())) {
-        setError(error, VSL_POSIX_ERROR(rc, "opendir of %s failed: %s", url, std::strerror(rc)));
-        return false;
-    }
-    return true;
-}
-
 // ---- move and copy ----
 
 namespace {

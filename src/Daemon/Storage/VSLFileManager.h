@@ -61,10 +61,6 @@ public:
     bool createDirectoryAtURL(const std::string& url, bool withIntermediateDirectories, mode_t mode,
                               VSLErrorRef* error) const;
 
-    // Whether `url` is a directory reached without a link that a user could have put on
-    // the way (see durable::openDirectoryNoFollow); ELOOP or ENOTDIR otherwise.
-    bool directoryIsReachableWithoutLinksAtURL(const std::string& url, VSLErrorRef* error) const;
-
     bool moveItemAtURL(const std::string& from, const std::string& to, VSLErrorRef* error) const;
     bool moveItemIfExistsAtURL(const std::string& from, const std::string& to, VSLErrorRef* error) const;
     bool copyItemAtURL(const std::string& from, const std::string& to, VSLErrorRef* error) const;
