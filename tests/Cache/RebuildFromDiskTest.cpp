@@ -20,23 +20,6 @@ namespace {
 
 const char* const kMetadataName = "/.com.tarrow.vesselry.metadata.plist";
 
-std::string str(const DaemonProcess::CtlResult& r, const char* key) {
-    const Value* v = r.reply.find(key);
-    return v && v->stringValue() ? *v->stringValue() : std::string();
-}
-
-std::string uuid(const DaemonProcess::CtlResult& r) {
-    const Value* v = r.reply.find("ReplyUUID");
-    if (!v || !v->dataValue()) return {};
-    auto u = Uuid::fromBytes(v->dataValue()->data(), v->dataValue()->size());
-    return u ? u->string() : std::string();
-}
-
-bool existed(const DaemonProcess::CtlResult& r) {
-    const Value* v = r.reply.find("ReplyExisted");
-    return v && v->boolValue().value_or(false);
-}
-
 size_t entriesIn(const std::string& dir) {
     size_t n = 0;
     if (auto d = opendir(dir.c_str())) {
@@ -88,10 +71,10 @@ TEST_F(RebuildFromDisk, MetadataReplacedByAFifoOrASymlinkIsSkippedWithoutBlockin
 
     // The owner of a container can swap its metadata file for any node: a FIFO that no
     // one writes, or a symlink to a file that would otherwise read as valid.
-    std::string fifoFile = str(fifo, "ReplyPath") + kMetadataName;
+    std::string fifoFile = fifo.string("ReplyPath") + kMetadataName;
     ASSERT_EQ(0, ::unlink(fifoFile.c_str()));
     ASSERT_EQ(0, ::mkfifo(fifoFile.c_str(), 0644));
-    std::string linkedFile = str(linked, "ReplyPath") + kMetadataName;
+    std::string linkedFile = linked.string("ReplyPath") + kMetadataName;
     std::string elsewhere = daemon.at("linked-metadata.plist");
     ASSERT_EQ(0, ::rename(linkedFile.c_str(), elsewhere.c_str()));
     ASSERT_EQ(0, ::symlink(elsewhere.c_str(), linkedFile.c_str()));
@@ -112,12 +95,12 @@ TEST_F(RebuildFromDisk, MetadataReplacedByAFifoOrASymlinkIsSkippedWithoutBlockin
     auto keptLookup = answerWithin(kLimit, "com.example.kept", 2);
     ASSERT_TRUE(keptLookup);
     ASSERT_EQ(1u, keptLookup->code()) << keptLookup->err;
-    EXPECT_EQ(uuid(kept), uuid(*keptLookup)) << "the rest of the class still loads";
+    EXPECT_EQ(kept.uuid(), keptLookup->uuid()) << "the rest of the class still loads";
     for (int containerClass : {2, 4}) {
         auto made = answerWithin(kLimit, "com.example.other" + std::to_string(containerClass), containerClass, true);
         ASSERT_TRUE(made) << "creation waits behind the blocked read";
         EXPECT_EQ(1u, made->code()) << made->err;
-        EXPECT_FALSE(existed(*made));
+        EXPECT_FALSE(made->existed());
     }
 
     // Damaged is not destroyed: the tampered nodes are still where they were.
@@ -135,7 +118,7 @@ TEST_F(RebuildFromDisk, AFailedMetadataReadFailsTheLookupAndCreatesNothing) {
     ASSERT_EQ(1u, made.code()) << made.err;
     auto neighbour = lookup("com.example.io-neighbour", 1, true);
     ASSERT_EQ(1u, neighbour.code()) << neighbour.err;
-    std::string path = str(made, "ReplyPath");
+    std::string path = made.string("ReplyPath");
     std::string classDirectory = path.substr(0, path.rfind('/'));
     std::string containerName = path.substr(path.rfind('/') + 1);
     ASSERT_EQ(2u, entriesIn(classDirectory));
@@ -151,11 +134,11 @@ TEST_F(RebuildFromDisk, AFailedMetadataReadFailsTheLookupAndCreatesNothing) {
     // The fault is gone: the index is built now, and the original is found.
     auto found = lookup("com.example.io", 1, true);
     ASSERT_EQ(1u, found.code()) << found.err;
-    EXPECT_TRUE(existed(found));
-    EXPECT_EQ(uuid(made), uuid(found));
-    EXPECT_EQ(path, str(found, "ReplyPath"));
+    EXPECT_TRUE(found.existed());
+    EXPECT_EQ(made.uuid(), found.uuid());
+    EXPECT_EQ(path, found.string("ReplyPath"));
     EXPECT_EQ(2u, entriesIn(classDirectory));
     auto other = lookup("com.example.io-neighbour", 1);
     ASSERT_EQ(1u, other.code());
-    EXPECT_EQ(uuid(neighbour), uuid(other));
+    EXPECT_EQ(neighbour.uuid(), other.uuid());
 }
