@@ -5,6 +5,7 @@
 #include <functional>
 
 #include "Cache/CacheTestSupport.h"
+#include "Daemon/Core/VSLPropertyListFile.h"
 #include "Daemon/Storage/VSLFileManager.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
 #include "Daemon/Storage/VSLMetadata.h"
@@ -122,6 +123,45 @@ TEST_F(Metadata, WriteStagesARenamedFileThatReadsBackWhole) {
     EXPECT_EQ(formatLog("Failed to move metadata from staging: %@ to final: %@", stagingFile, nowhere),
               error->localizedDescription.value_or(""));
     EXPECT_TRUE(VSLFileManager::defaultManager().itemExistsAtURL(stagingFile));
+}
+
+TEST_F(Metadata, WriterRefusesWhatTheReaderWouldRefuseAndWritesNothing) {
+    std::string dir = joinPath(classDirectory(mobile, 2), Uuid::random().string());
+    ASSERT_EQ(0, ::mkdir(dir.c_str(), 0755));
+    uint64_t code = kVSLSuccess;
+    auto identity = VSLConcreteContainerIdentity::containerIdentityWithUUID(Uuid::random(), mobile, kIdentifier, 2, &code);
+    auto withInfo = [&](size_t blobSize) {
+        return VSLMetadata::initWithContainerIdentity(
+            identity, dict({{"Blob", Value::data(Data(blobSize, 0x78))}}), dir, std::nullopt);
+    };
+    std::string file = metadataPathOf(dir);
+    std::string staging = *VSLGlobalConfiguration::sharedInstance()->stagingDirectoryURLForUserIdentity(mobile, 2);
+    std::string stagingFile = joinPath(staging, "temp_metadata-" + identity->uuid().string() + ".plist");
+
+    // Just under the limit: written, and read back whole after a restart would.
+    VSLErrorRef error;
+    ASSERT_TRUE(withInfo(kVSLMaxPropertyListFileSize - 4096)->writeMetadataToDiskWithError(&error))
+        << error->description();
+    auto back = read(dir, &error);
+    ASSERT_TRUE(back) << error->description();
+    const std::string before = readFile(file);
+
+    // Over it: refused with a code, the old file untouched, no staged bytes left anywhere.
+    error.reset();
+    EXPECT_FALSE(withInfo(kVSLMaxPropertyListFileSize)->writeMetadataToDiskWithError(&error));
+    ASSERT_TRUE(error);
+    EXPECT_EQ(kVSLErrorWriteFile, static_cast<uint64_t>(error->code));
+    ASSERT_TRUE(error->underlyingError);
+    EXPECT_TRUE(isPOSIXError(error->underlyingError, EFBIG)) << error->underlyingError->description();
+    EXPECT_TRUE(before == readFile(file)) << "the container's file is the one written before";
+    EXPECT_FALSE(VSLFileManager::defaultManager().itemExistsAtURL(stagingFile));
+
+    // The same for a first write: no file appears at all.
+    std::string fresh = joinPath(classDirectory(mobile, 2), Uuid::random().string());
+    ASSERT_EQ(0, ::mkdir(fresh.c_str(), 0755));
+    EXPECT_FALSE(withInfo(kVSLMaxPropertyListFileSize)->writeMetadataToFileURL(metadataPathOf(fresh), &error));
+    EXPECT_FALSE(VSLFileManager::defaultManager().itemExistsAtURL(metadataPathOf(fresh)));
+    EXPECT_FALSE(VSLFileManager::defaultManager().itemExistsAtURL(stagingFile));
 }
 
 TEST_F(Metadata, BundleRecordKeepsNoUserIdentityAndReadsAsTheDefault) {

@@ -21,24 +21,6 @@ using namespace vsl::test;
 
 namespace {
 
-std::string str(const DaemonProcess::CtlResult& r, const char* key) {
-    const Value* v = r.reply.find(key);
-    return v && v->stringValue() ? *v->stringValue() : std::string();
-}
-
-// UUIDs come back from the property-list output as their 16 bytes.
-std::string uuid(const DaemonProcess::CtlResult& r) {
-    const Value* v = r.reply.find("ReplyUUID");
-    if (!v || !v->dataValue()) return {};
-    auto u = Uuid::fromBytes(v->dataValue()->data(), v->dataValue()->size());
-    return u ? u->string() : std::string();
-}
-
-bool existed(const DaemonProcess::CtlResult& r) {
-    const Value* v = r.reply.find("ReplyExisted");
-    return v && v->boolValue().value_or(false);
-}
-
 class Containers : public ::testing::Test {
 protected:
     void SetUp() override {
@@ -56,9 +38,9 @@ protected:
 TEST_F(Containers, OwnDataContainerIsMadeOnceAndFoundAgain) {
     auto made = daemon.run(app, {"createOrLookup", "ContainerClass=2", "CreateIfNecessary=true"});
     ASSERT_EQ(1u, made.code()) << made.err;
-    EXPECT_FALSE(existed(made));
-    EXPECT_EQ("com.example.app", str(made, "ReplyIdentifier")) << "no Identifier: the client's own";
-    std::string path = str(made, "ReplyPath");
+    EXPECT_FALSE(made.existed());
+    EXPECT_EQ("com.example.app", made.string("ReplyIdentifier")) << "no Identifier: the client's own";
+    std::string path = made.string("ReplyPath");
     EXPECT_EQ(0u, path.find(daemon.at("private/var/mobile/Containers/Data/Application/")));
     EXPECT_FALSE(made.reply.find("ReplySandboxToken")) << "not sandboxed: no token";
 
@@ -77,17 +59,17 @@ TEST_F(Containers, OwnDataContainerIsMadeOnceAndFoundAgain) {
 
     auto again = daemon.run(app, {"createOrLookup", "ContainerClass=2"});
     ASSERT_EQ(1u, again.code());
-    EXPECT_TRUE(existed(again));
-    EXPECT_EQ(uuid(made), uuid(again));
-    EXPECT_EQ(path, str(again, "ReplyPath"));
+    EXPECT_TRUE(again.existed());
+    EXPECT_EQ(made.uuid(), again.uuid());
+    EXPECT_EQ(path, again.string("ReplyPath"));
 
     // The daemon forgets nothing across a restart.
     ASSERT_EQ(0, daemon.stop());
     ASSERT_TRUE(daemon.start());
     auto afterRestart = daemon.run(app, {"createOrLookup", "ContainerClass=2"});
     ASSERT_EQ(1u, afterRestart.code());
-    EXPECT_TRUE(existed(afterRestart));
-    EXPECT_EQ(uuid(made), uuid(afterRestart));
+    EXPECT_TRUE(afterRestart.existed());
+    EXPECT_EQ(made.uuid(), afterRestart.uuid());
 }
 
 TEST_F(Containers, AbsentOrForeignContainersAreRefused) {
@@ -114,8 +96,8 @@ TEST_F(Containers, ConcurrentCreatorsGetOneContainer) {
     int created = 0;
     for (auto& r : results) {
         ASSERT_EQ(1u, r.code()) << r.err;
-        uuids.insert(uuid(r));
-        created += existed(r) ? 0 : 1;
+        uuids.insert(r.uuid());
+        created += r.existed() ? 0 : 1;
     }
     EXPECT_EQ(1u, uuids.size());
     EXPECT_EQ(1, created) << "exactly one caller made it";
@@ -134,14 +116,14 @@ TEST_F(Containers, TransientRecreateAndDelete) {
     auto second = daemon.run(admin, {"createOrLookup", "Identifier=com.example.t", "ContainerClass=2",
                                      "Transient=true", "CreateIfNecessary=true"});
     ASSERT_EQ(1u, second.code());
-    EXPECT_NE(uuid(first), uuid(second)) << "a transient request never returns the old transient container";
-    EXPECT_NE(0, ::access(str(first, "ReplyPath").c_str(), F_OK)) << "the old one left its place for death row";
+    EXPECT_NE(first.uuid(), second.uuid()) << "a transient request never returns the old transient container";
+    EXPECT_NE(0, ::access(first.string("ReplyPath").c_str(), F_OK)) << "the old one left its place for death row";
 
     auto made = daemon.run(admin, {"createOrLookup", "Identifier=com.example.d", "ContainerClass=2",
                                    "CreateIfNecessary=true"});
     ASSERT_EQ(1u, made.code());
     EXPECT_EQ(1u, daemon.run(admin, {"deleteContainer", "Identifier=com.example.d", "ContainerClass=2"}).code());
-    EXPECT_NE(0, ::access(str(made, "ReplyPath").c_str(), F_OK)) << "gone from its class directory at the reply";
+    EXPECT_NE(0, ::access(made.string("ReplyPath").c_str(), F_OK)) << "gone from its class directory at the reply";
     EXPECT_EQ(21u, daemon.run(admin, {"createOrLookup", "Identifier=com.example.d", "ContainerClass=2"}).code());
 }
 

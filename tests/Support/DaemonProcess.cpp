@@ -186,6 +186,23 @@ uint64_t DaemonProcess::CtlResult::code() const {
     return c && c->uint64Value() ? *c->uint64Value() : 0;
 }
 
+std::string DaemonProcess::CtlResult::string(const char* key) const {
+    const Value* v = reply.find(key);
+    return v && v->stringValue() ? *v->stringValue() : std::string();
+}
+
+std::string DaemonProcess::CtlResult::uuid() const {
+    const Value* v = reply.find("ReplyUUID");
+    if (!v || !v->dataValue()) return {};
+    auto u = Uuid::fromBytes(v->dataValue()->data(), v->dataValue()->size());
+    return u ? u->string() : std::string();
+}
+
+bool DaemonProcess::CtlResult::existed() const {
+    const Value* v = reply.find("ReplyExisted");
+    return v && v->boolValue().value_or(false);
+}
+
 DaemonProcess::CtlResult DaemonProcess::run(const std::string& client, const std::vector<std::string>& args) const {
     std::vector<std::string> argv = {client, "--root", root_, "--plist"};
     argv.insert(argv.end(), args.begin(), args.end());

@@ -51,6 +51,12 @@ public:
         Value reply;  // parsed back from the --plist output
         // "ReplyError", or 0 when there is no readable reply.
         uint64_t code() const;
+        // A string of the reply, or empty.
+        std::string string(const char* key) const;
+        // "ReplyUUID" (16 bytes in the output) as a string, or empty.
+        std::string uuid() const;
+        // "ReplyExisted", false when absent.
+        bool existed() const;
     };
     // Runs a client program (a path from addClient, or vesselctlPath()) with --root.
     CtlResult run(const std::string& client, const std::vector<std::string>& args) const;

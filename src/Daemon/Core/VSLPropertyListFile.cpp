@@ -4,11 +4,15 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cerrno>
+#include <cstdlib>
 #include <cstring>
+#include <new>
 
 #include "Platform/DurableIO.h"
 #include "Platform/PropertyList.h"
+#include "Platform/UniqueFd.h"
 
 namespace vsl {
 
@@ -24,6 +28,19 @@ VSLErrorRef generalError(const char* function, int line, int64_t code, const std
     return e;
 }
 
+#ifdef VESSEL_KILLPOINTS
+// Test builds: VESSELD_TEST_FAIL_READ=TEXT makes the first read of a path containing
+// TEXT fail with EIO, once per process.
+bool injectedReadFailure(const std::string& path) {
+    static const char* const pattern = std::getenv("VESSELD_TEST_FAIL_READ");
+    static std::atomic<bool> spent{false};
+    if (!pattern || !*pattern || spent.load() || path.find(pattern) == std::string::npos) return false;
+    return !spent.exchange(true);
+}
+#else
+bool injectedReadFailure(const std::string&) { return false; }
+#endif
+
 }  // namespace
 
 bool VSL_writeToURL(const Value& dictionary, const std::string& path, unsigned options, VSLErrorRef* error) {
@@ -31,6 +48,14 @@ bool VSL_writeToURL(const Value& dictionary, const std::string& path, unsigned o
     auto bytes = encodeBinaryPropertyList(dictionary, &why);
     if (!bytes) {
         if (error) *error = generalError(__func__, __LINE__, kGeneralErrorUnreadablePropertyList, why);
+        return false;
+    }
+    // A file the reader would refuse must never be written: it would read as damaged.
+    if (bytes->size() > kVSLMaxPropertyListFileSize) {
+        if (error)
+            *error = VSL_POSIX_ERROR(EFBIG, "Refusing to write %@: %llu bytes exceed the read limit of %llu", path,
+                                     static_cast<unsigned long long>(bytes->size()),
+                                     static_cast<unsigned long long>(kVSLMaxPropertyListFileSize));
         return false;
     }
     // No protection classes on this file: nothing to do on a system without them.
@@ -46,31 +71,36 @@ bool VSL_writeToURL(const Value& dictionary, const std::string& path, unsigned o
 std::optional<Value> VSL_dictionaryWithContentsOfURL(const std::string& path, unsigned options,
                                                      VSLErrorRef* error) {
     (void)options;
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) {
-        int err = errno;
-        if (error) *error = VSL_POSIX_ERROR(err, "Failed to open %@: %s", path, std::strerror(err));
+    const char* const function = __func__;
+    auto refuse = [&](int err, const char* what) -> std::optional<Value> {
+        if (error) *error = createPOSIXError(function, __LINE__, err, "%s %@: %s", what, path, std::strerror(err));
         return std::nullopt;
-    }
+    };
+    if (injectedReadFailure(path)) return refuse(EIO, "Failed to read");
+    // Not a symlink, and never blocking on a FIFO or device someone put in its place.
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK));
+    if (!fd) return refuse(errno, "Failed to open");
     // Read from the file itself each time (no parsed copy is kept anywhere); the page
     // cache is coherent with the file, and dropping it made class rebuilds ~6x slower.
     struct stat st;
-    if (::fstat(fd, &st) != 0 || !S_ISREG(st.st_mode) || static_cast<size_t>(st.st_size) > kVSLMaxPropertyListFileSize) {
-        int err = S_ISREG(st.st_mode) ? EFBIG : EINVAL;
-        ::close(fd);
-        if (error) *error = VSL_POSIX_ERROR(err, "Refusing to read %@: %s", path, std::strerror(err));
-        return std::nullopt;
-    }
+    if (::fstat(fd.get(), &st) != 0) return refuse(errno, "Failed to stat");
+    if (!S_ISREG(st.st_mode)) return refuse(EINVAL, "Refusing to read a file that is not regular:");
+    if (static_cast<size_t>(st.st_size) > kVSLMaxPropertyListFileSize) return refuse(EFBIG, "Refusing to read");
     std::string bytes;
-    bytes.resize(static_cast<size_t>(st.st_size));
+    try {
+        bytes.resize(static_cast<size_t>(st.st_size));
+    } catch (const std::bad_alloc&) {
+        return refuse(ENOMEM, "Failed to read");
+    }
     size_t got = 0;
     while (got < bytes.size()) {
-        ssize_t n = ::read(fd, bytes.data() + got, bytes.size() - got);
+        ssize_t n = ::read(fd.get(), bytes.data() + got, bytes.size() - got);
         if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) break;
+        if (n < 0) return refuse(errno, "Failed to read");
+        if (n == 0) break;  // shrank meanwhile: the parser sees a torn file
         got += static_cast<size_t>(n);
     }
-    ::close(fd);
+    fd.reset();
     bytes.resize(got);
     std::string why;
     auto value = decodePropertyList(bytes.data(), bytes.size(), &why);
@@ -85,6 +115,15 @@ std::optional<Value> VSL_dictionaryWithContentsOfURL(const std::string& path, un
         return std::nullopt;
     }
     return value;
+}
+
+bool isReadFailure(const VSLErrorRef& error) {
+    for (const VSLError* e = error.get(); e; e = e->underlyingError.get()) {
+        if (e->domain != VSLPOSIXErrorDomain) continue;
+        for (int err : {EIO, ENOMEM, EMFILE, ENFILE, EACCES})
+            if (e->code == err) return true;
+    }
+    return false;
 }
 
 bool containsDotDotPathComponents(const std::string& path) {

@@ -21,7 +21,7 @@ namespace vsl {
 
 class VSLUserIdentityCache;
 class VSLMetadata;
-using VSLMetadataRef = std::shared_ptr<VSLMetadata>;
+using VSLMetadataRef = std::shared_ptr<const VSLMetadata>;
 class VSLReply;
 
 // "com.tarrow.vesseld.deathrow": serial, background priority.

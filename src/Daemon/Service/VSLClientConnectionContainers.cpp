@@ -32,10 +32,7 @@ bool isNotFound(const VSLErrorRef& e) { return errorHasCode(e, kVSLErrorNotFound
 
 // The cache shares its records between requests: "existed" belongs to this call only.
 VSLMetadataRef foundRecord(const VSLMetadataRef& cached) {
-    auto copy = VSLMetadata::initWithContainerIdentity(cached->containerIdentity(), cached->info(), cached->url(),
-                                                       cached->userManagedAssetsDirName());
-    if (!copy) return cached;
-    copy->setTransient(cached->transient());
+    auto copy = cached->mutableCopy();
     copy->setExisted(true);
     return copy;
 }

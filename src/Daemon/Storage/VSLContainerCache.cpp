@@ -4,6 +4,7 @@
 #include "Daemon/CodeSigning/VSLWhitelist.h"
 #include "Daemon/Core/VSLExceptionGuard.h"
 #include "Daemon/Core/VSLInvariant.h"
+#include "Daemon/Core/VSLPropertyListFile.h"
 #include "Daemon/Storage/VSLFileManager.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
 #include "Platform/SystemRoot.h"
@@ -36,6 +37,14 @@ VSLErrorRef rebuildError(const char* function, int line, const VSLUserIdentityRe
     return createVSLError(function, line, kVSLErrorCacheRebuild, std::move(underlying), true,
                           "Cache: [%@]-%@%@: Failed to rebuild", identifierOf(userIdentity),
                           containerClassDirectoryName(containerClass), transientMarker(transient));
+}
+
+// Records are shared as they are: one placed elsewhere is a new record.
+VSLMetadataRef recordAt(const VSLMetadataRef& metadata, const std::string& url) {
+    if (metadata->url() == url) return metadata;
+    auto moved = metadata->mutableCopy();
+    moved->setUrl(url);
+    return moved;
 }
 
 }  // namespace
@@ -117,10 +126,18 @@ bool VSLContainerCache::_lock_getCache(ClassIndex& index, const std::string& key
     records.reserve(entries->size());
     for (const VSLItemURL& entry : *entries) {
         if (!containerURLIsValidForContainerClass(entry.path, containerClass)) continue;
-        // Invalid files are skipped: the rest of the class must still load.
-        auto metadata = VSLMetadata::readAndValidateMetadataAtUrl(entry.path, userIdentity, true, nullptr,
+        // Damaged files are skipped, so the rest of the class still loads. A failed
+        // read says nothing about the file: taking it for absent would let the next
+        // create make a second container, so the index stays unbuilt instead.
+        VSLErrorRef readError;
+        auto metadata = VSLMetadata::readAndValidateMetadataAtUrl(entry.path, userIdentity, true, &readError,
                                                                   userIdentityCache_.get());
-        if (metadata) records[metadata->identifier()] = std::move(metadata);
+        if (metadata)
+            records[metadata->identifier()] = std::move(metadata);
+        else if (isReadFailure(readError)) {
+            if (error) *error = std::move(readError);
+            return false;
+        }
     }
     index.records = std::move(records);
     index.built = true;
@@ -252,8 +269,10 @@ VSLMetadataRef VSLContainerCache::containerForContainerIdentity(const VSLConcret
     for (bool transient : {false, true}) {
         auto metadata = containerForContainerIdentity(identity, transient, true, nullptr);
         if (metadata && metadata->uuid() == identity->uuid()) {
-            metadata->setTransient(transient);
-            return metadata;
+            if (metadata->transient() == transient) return metadata;
+            auto marked = metadata->mutableCopy();
+            marked->setTransient(transient);
+            return marked;
         }
     }
     return nullptr;
@@ -341,8 +360,7 @@ bool VSLContainerCache::addContainerMetadata(const VSLMetadataRef& metadata, con
                 if (error) *error = e;
                 return false;
             }
-            metadata->setUrl(url);
-            index->records[metadata->identifier()] = metadata;
+            index->records[metadata->identifier()] = recordAt(metadata, url);
             if (updateSandbox)
                 registers =
                     shouldRegisterSandboxMappingWithUserIdentity(userIdentity, metadata->identifier(), containerClass);

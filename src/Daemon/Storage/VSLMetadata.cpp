@@ -33,9 +33,9 @@ std::string expectedClassDirectory(const std::string& containerDirectory, VSLCon
 
 }  // namespace
 
-VSLMetadataRef VSLMetadata::initWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity,
-                                                      std::optional<Value> info, std::string url,
-                                                      std::optional<std::string> userManagedAssetsDirName) {
+VSLMutableMetadataRef VSLMetadata::initWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity,
+                                                             std::optional<Value> info, std::string url,
+                                                             std::optional<std::string> userManagedAssetsDirName) {
     if (!identity) return nullptr;
     return std::make_shared<VSLMetadata>(Passkey{}, *identity, std::move(info), std::move(url),
                                          std::move(userManagedAssetsDirName));
@@ -50,6 +50,8 @@ VSLMetadata::VSLMetadata(Passkey, const VSLConcreteContainerIdentity& identity, 
       url_(std::move(url)),
       userManagedAssetsDirName_(std::move(userManagedAssetsDirName)),
       info_(std::move(info)) {}
+
+VSLMutableMetadataRef VSLMetadata::mutableCopy() const { return std::make_shared<VSLMetadata>(Passkey{}, *this); }
 
 Value VSLMetadata::metadataDictionary() const {
     Dictionary d;

@@ -3,11 +3,11 @@
 // which user identity, under which UUID, plus optional info values and the name of
 // the user-managed assets directory. The file is the ground truth the container
 // cache is rebuilt from, so every read validates it strictly, in a fixed order.
-// The record has no lock: callers that share one across threads set its fields
-// before they publish it (transient and existed may be set at any time).
+// The record has no lock because a shared one never changes: it is built and filled
+// in as a VSLMutableMetadataRef, then handed out as a VSLMetadataRef (const), and a
+// change (new URL, UUID, info, flags) is made on a mutableCopy() that replaces it.
 #pragma once
 
-#include <atomic>
 #include <memory>
 #include <optional>
 #include <string>
@@ -21,7 +21,8 @@ namespace vsl {
 
 class VSLMetadata;
 class VSLUserIdentityCache;
-using VSLMetadataRef = std::shared_ptr<VSLMetadata>;
+using VSLMetadataRef = std::shared_ptr<const VSLMetadata>;
+using VSLMutableMetadataRef = std::shared_ptr<VSLMetadata>;
 
 // Keys of the metadata file.
 extern const char* const kVSLMetadataIdentifierKey;         // "VSLMetadataIdentifier"
@@ -38,11 +39,15 @@ class VSLMetadata {
 
 public:
     // None when the identity is none.
-    static VSLMetadataRef initWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity,
-                                                    std::optional<Value> info, std::string url,
-                                                    std::optional<std::string> userManagedAssetsDirName);
+    static VSLMutableMetadataRef initWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity,
+                                                           std::optional<Value> info, std::string url,
+                                                           std::optional<std::string> userManagedAssetsDirName);
     VSLMetadata(Passkey, const VSLConcreteContainerIdentity& identity, std::optional<Value> info, std::string url,
                 std::optional<std::string> userManagedAssetsDirName);
+    VSLMetadata(Passkey, const VSLMetadata& other) : VSLMetadata(other) {}
+
+    // A private copy, all fields included, to change before it is shared in turn.
+    VSLMutableMetadataRef mutableCopy() const;
 
     // Into `url`, through a staging file (fsynced) renamed into place, then the
     // container directory fsynced. Code 34 on failure.
@@ -77,18 +82,21 @@ public:
     const std::optional<Value>& info() const { return info_; }
     void setInfo(std::optional<Value> info) { info_ = std::move(info); }
 
-    bool transient() const { return transient_.load(std::memory_order_relaxed); }
-    void setTransient(bool transient) { transient_.store(transient, std::memory_order_relaxed); }
-    bool existed() const { return existed_.load(std::memory_order_relaxed); }
-    void setExisted(bool existed) { existed_.store(existed, std::memory_order_relaxed); }
+    bool transient() const { return transient_; }
+    void setTransient(bool transient) { transient_ = transient; }
+    bool existed() const { return existed_; }
+    void setExisted(bool existed) { existed_ = existed; }
 
     // None when the fields do not make a valid identity.
     VSLConcreteContainerIdentityRef containerIdentity() const;
     std::string description() const;
 
 private:
-    std::atomic<bool> transient_{false};
-    std::atomic<bool> existed_{false};
+    VSLMetadata(const VSLMetadata&) = default;
+    VSLMetadata& operator=(const VSLMetadata&) = delete;
+
+    bool transient_ = false;
+    bool existed_ = false;
     const VSLContainerClass containerClass_;
     const VSLUserIdentityRef userIdentity_;
     const std::string identifier_;
