@@ -88,15 +88,9 @@ bool VSLMetadata::writeMetadataToFileURL(const std::string& fileURL, VSLErrorRef
         if (error) *error = e;
         return false;
     }
+    // The move syncs both directories.
     VSLErrorRef moveError;
-    bool moved = VSLFileManager::defaultManager().moveItemAtURL(*stagingURL, fileURL, &moveError);
-    if (moved) {
-        if (int rc = durable::fsyncParent(fileURL)) {
-            moveError = VSL_POSIX_ERROR(rc, "fsync of %@ failed: %s", parentPath(fileURL), std::strerror(rc));
-            moved = false;
-        }
-    }
-    if (!moved) {
+    if (!VSLFileManager::defaultManager().moveItemAtURL(*stagingURL, fileURL, &moveError)) {
         auto e = VSL_ERROR(kVSLErrorWriteFile, moveError, true, "Failed to move metadata from staging: %@ to final: %@",
                            *stagingURL, fileURL);
         if (error) *error = e;
