@@ -6,7 +6,6 @@
 #include "Daemon/Core/VSLUserIdentityCache.h"
 #include "Daemon/Storage/VSLFileManager.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
-#include "Platform/DurableIO.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {
