@@ -263,7 +263,7 @@ bool VSLSQLiteDB::addCodeSigningEntry(const VSLCodeSigningEntry* entry, const st
             VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec commit");
         return true;
     } catch (...) {
-        VSLErrorRef e = errorForCaughtException(__func__, __LINE__);
+        VSLErrorRef e = errorForCaughtException(VSL_FUNCTION, __LINE__);
         if (began) _rollback(&e);
         return failWithError(error, e);
     }
@@ -312,14 +312,14 @@ bool VSLSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
                 osLog(LogCategory::Database, OSLogLevel::Debug, "Invalidating code signing info for %@ child: %@",
                       identifier, item);
             else
-                LogWrite(kLogLevelError, __func__, "Failed to invalidate code signing info for %@ child %@ : %@",
+                LogWrite(kLogLevelError, VSL_FUNCTION, "Failed to invalidate code signing info for %@ child %@ : %@",
                          identifier, item, itemError);
         }
         if (!_sqliteExec("COMMIT;", &execError))
             VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec commit");
         return true;
     } catch (...) {
-        VSLErrorRef e = errorForCaughtException(__func__, __LINE__);
+        VSLErrorRef e = errorForCaughtException(VSL_FUNCTION, __LINE__);
         if (began) _rollback(&e);
         return failWithError(error, e);
     }
@@ -334,7 +334,7 @@ bool VSLSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(VSLErrorRe
                              kFlagAdvanceCopy, url_, sqlite3_errmsg(db_)));
     if (!statement.stepToDone(error)) return false;
     int changes = sqlite3_changes(db_);
-    if (changes > 0) LogWrite(kLogLevelError, __func__, "Deleted %d advance copies of code signing info.", changes);
+    if (changes > 0) LogWrite(kLogLevelError, VSL_FUNCTION, "Deleted %d advance copies of code signing info.", changes);
     return true;
 }
 

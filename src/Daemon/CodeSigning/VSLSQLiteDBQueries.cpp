@@ -82,7 +82,7 @@ std::optional<VSLCodeSigningEntry> VSLSQLiteDB::codeSigningEntryWithIdentifier(c
                                                "Identifier: \"%@\" Not Found in DB", identifier));
                 return std::nullopt;
             }
-            LogWrite(kLogLevelError, __func__, "Error retrieving code signing entry: %@", selectError);
+            LogWrite(kLogLevelError, VSL_FUNCTION, "Error retrieving code signing entry: %@", selectError);
             failWithError(error, selectError);
             return std::nullopt;
         }
@@ -91,7 +91,7 @@ std::optional<VSLCodeSigningEntry> VSLSQLiteDB::codeSigningEntryWithIdentifier(c
     if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
         entry->childBundleIdentifiers = std::move(children);
     } else if (!isErrorCode(childError, kVSLErrorNotInDatabase)) {
-        LogWrite(kLogLevelError, __func__, "Error retrieving childBundleIds: %@", childError);
+        LogWrite(kLogLevelError, VSL_FUNCTION, "Error retrieving childBundleIds: %@", childError);
         failWithError(error, childError);
         return std::nullopt;
     }
