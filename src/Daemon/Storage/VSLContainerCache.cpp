@@ -409,30 +409,27 @@ bool VSLContainerCache::removeContainerForUserIdentity(const VSLUserIdentityRef&
 
 void VSLContainerCache::invalidateUserIdentity(const VSLUserIdentityRef& userIdentity) {
     assertNotOnCodeSigningQueue();
-    std::vector<std::pair<VSLContainerClass, std::shared_ptr<ClassIndex>>> dropped;
+    std::vector<std::pair<VSLContainerClass, std::shared_ptr<ClassIndex>>> live;
     {
         std::lock_guard<std::mutex> lock(cacheLock_);
         for (VSLContainerClass c = 1; c <= 13; c++) {
             const std::string key = _cacheKeyForUserIdentity(userIdentity, c);
-            if (auto it = liveContainerCache_.find(key); it != liveContainerCache_.end()) {
-                dropped.emplace_back(c, std::move(it->second));
-                liveContainerCache_.erase(it);
-            }
+            if (auto it = liveContainerCache_.find(key); it != liveContainerCache_.end())
+                live.emplace_back(c, it->second);
             transientContainerCache_.erase(key);
         }
     }
-    // A rebuild still running on a dropped index finishes first; its records then
-    // leave the kernel state with the rest.
-    for (const auto& [containerClass, index] : dropped) {
-        std::vector<std::string> identifiers;
-        {
-            std::lock_guard<std::mutex> lock(index->mutex);
-            for (const auto& [identifier, metadata] : index->records) identifiers.push_back(identifier);
-        }
-        for (const auto& identifier : identifiers)
+    // A live index is emptied in place, its sandbox items removed under its mutex: a
+    // rebuild of the key (running now, or the next one) holds that mutex too, so the
+    // items it pushes can never be removed by this invalidation afterwards.
+    for (const auto& [containerClass, index] : live) {
+        std::lock_guard<std::mutex> lock(index->mutex);
+        for (const auto& [identifier, metadata] : index->records)
             if (!setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, std::nullopt))
-                LogWrite(kLogLevelError, __func__, "Failed to remove container mapping of [%@], class: %llu",
+                LogWrite(kLogLevelError, VSL_FUNCTION, "Failed to remove container mapping of [%@], class: %llu",
                          identifier, containerClass);
+        index->records.clear();
+        index->built = false;
     }
     uint32_t status = hooks_.postUserInvalidatedNotification ? hooks_.postUserInvalidatedNotification() : 0;
     if (status != 0)
