@@ -7,6 +7,7 @@
 #include <map>
 #include <set>
 #include <stdexcept>
+#include <thread>
 
 #include "Cache/CacheTestSupport.h"
 #include "Daemon/CodeSigning/VSLWhitelist.h"
@@ -390,6 +391,39 @@ TEST_F(ContainerCache, ConcurrentChangesAndInvalidationsLoseNoContainer) {
         }
         EXPECT_EQ(expected, listed);
     }
+}
+
+TEST_F(ContainerCache, AnInvalidationRacingARebuildLeavesNoBuiltIndexUnmirrored) {
+    makeContainer(mobile, 2, "com.a");
+    std::promise<void> scanning, release;
+    std::shared_future<void> released = release.get_future().share();
+    std::atomic<int> appDataScans{0};
+    auto raced = makeCache([&](const std::string& key) {
+        if (key == kAppData && appDataScans++ == 0) {
+            scanning.set_value();
+            released.wait();
+        }
+    });
+    // A rebuild stalls in its scan; an invalidation of the same identity comes, then
+    // another lookup of the key. The pauses only give each a chance to get as far as
+    // it can; whatever the order, the outcome below must hold.
+    auto first = std::async(std::launch::async, [&] { return lookup(*raced, mobile, 2, "com.a"); });
+    scanning.get_future().wait();
+    auto invalidation = std::async(std::launch::async, [&] { raced->invalidateUserIdentity(mobile); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    auto second = std::async(std::launch::async, [&] { return lookup(*raced, mobile, 2, "com.a"); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    release.set_value();
+    ASSERT_EQ(std::future_status::ready, first.wait_for(kBound));
+    ASSERT_EQ(std::future_status::ready, invalidation.wait_for(kBound));
+    ASSERT_EQ(std::future_status::ready, second.wait_for(kBound));
+    EXPECT_TRUE(first.get());
+    EXPECT_TRUE(second.get());
+
+    // A built index pushes nothing more, so its container must already be in the
+    // sandbox state; an index that was dropped is rebuilt here and pushes it.
+    ASSERT_TRUE(lookup(*raced, mobile, 2, "com.a"));
+    EXPECT_EQ(1u, sandboxItems(501, 1).size()) << appDataScans.load() << " scans";
 }
 
 TEST_F(ContainerCache, AnExceptionBecomesCode40AndLeavesTheCacheUsable) {

@@ -58,6 +58,9 @@ TEST(CodeSigningEndToEnd, CommandsStoreReturnAndInvalidateCodeSigningInfo) {
     ASSERT_EQ(1u, r.code()) << r.err;
     r = daemon.run(installer, {"processCodeSigningInfo", "CodeSigningInfo=@" + infoPath});
     EXPECT_EQ(18u, r.code()) << "no identifier";
+    r = daemon.run(installer, {"processCodeSigningInfo", "Identifier=", "CodeSigningInfo=@" + infoPath});
+    EXPECT_EQ(18u, r.code()) << "an empty identifier is no identifier";
+    EXPECT_EQ(21u, daemon.run(installer, {"getCodeSigningInfo", "Identifier="}).code()) << "nothing stored under \"\"";
     r = daemon.run(stranger, {"processCodeSigningInfo", "Identifier=com.example.evil", "CodeSigningInfo=@" + infoPath});
     EXPECT_EQ(55u, r.code()) << "not entitled";
 

@@ -269,3 +269,36 @@ TEST(VSLSQLiteDBDeathTest, AFileThatCannotBeUsedEndsTheProcessWithTheCrashMessag
     EXPECT_DEATH(VSLSQLiteDB::initWithParentDirectoryURL(codeSigningTestRoot().at("scratch/no/such/dir")),
                  "opening .*containers.sqlite3 failed(.|\n)*Failed to open database, err = 14");
 }
+
+TEST(VSLSQLiteDB, AFailedCommitIsRolledBackAndTheNextTransactionWorks) {
+    std::string dir = freshDirectory("commit");
+    VSLSQLiteDB::initWithParentDirectoryURL(dir);  // the schema
+    {
+        // Storing "com.example.doomed" adds a row whose deferred foreign key points
+        // nowhere: its COMMIT fails and leaves SQLite inside the transaction.
+        RawDatabase raw(databasePath(dir));
+        raw.exec("CREATE TABLE doom (ref INTEGER REFERENCES code_signing_info(id) DEFERRABLE INITIALLY DEFERRED);"
+                 "CREATE TRIGGER doom_on_insert AFTER INSERT ON code_signing_info "
+                 "WHEN NEW.code_signing_id_text = 'com.example.doomed' "
+                 "BEGIN INSERT INTO doom (ref) VALUES (-1); END;");
+    }
+    auto db = VSLSQLiteDB::initWithParentDirectoryURL(dir);
+    ASSERT_TRUE(db);
+    auto doomed = entryWith("doomed");
+    db->addCodeSigningEntry(&doomed, std::string("com.example.doomed"), nullptr);
+    VSLErrorRef error;
+    EXPECT_FALSE(db->codeSigningEntryWithIdentifier("com.example.doomed", &error)) << "rolled back";
+    EXPECT_TRUE(isCode(error, kVSLErrorNotInDatabase));
+
+    auto fine = entryWith("fine", {"com.example.fine.child"});
+    ASSERT_TRUE(db->addCodeSigningEntry(&fine, std::string("com.example.fine"), &error))
+        << (error ? error->description() : "");
+    ASSERT_TRUE(db->invalidateCodeSigningForIdentifierAndAllChildren("com.example.fine", &error))
+        << (error ? error->description() : "");
+    db.reset();
+    db = VSLSQLiteDB::initWithParentDirectoryURL(dir);
+    auto back = db->codeSigningEntryWithIdentifier("com.example.fine", nullptr);
+    ASSERT_TRUE(back) << "committed, so it outlives the connection";
+    EXPECT_TRUE(back->invalid);
+    EXPECT_EQ(std::set<std::string>{"com.example.fine"}, db->identifiersWithError(nullptr));
+}

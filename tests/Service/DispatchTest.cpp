@@ -144,3 +144,26 @@ TEST_F(Dispatch, MalformedFramesCloseOnlyThatConnection) {
     // The test binary has no policy record: refused, but answered.
     EXPECT_EQ(55u, r.body.find("ReplyError")->uint64Value());
 }
+
+TEST(DispatchQueue, WorkQueuedByEntitlementRegistrationRunsEvenWithoutAHandler) {
+    DaemonProcess daemon;
+    // One signing identifier, two builds: the second no longer claims a system container.
+    std::string before = daemon.addClient(
+        "before", "com.example.sys",
+        dict({{kAllowed, Value::boolean(true)}, {"com.tarrow.security.system-container", Value::boolean(true)}}));
+    std::string after = daemon.addClient("after", "com.example.sys", dict({{kAllowed, Value::boolean(true)}}));
+    ASSERT_TRUE(daemon.start()) << test::readFile(daemon.at("vesseld.stderr"));
+    auto made = daemon.run(before, {"createOrLookup", "ContainerClass=12", "CreateIfNecessary=true"});
+    ASSERT_EQ(1u, made.code()) << made.err;
+    const Value* path = made.reply.find("ReplyPath");
+    ASSERT_TRUE(path && path->stringValue());
+    ASSERT_EQ(0, ::access(path->stringValue()->c_str(), F_OK));
+
+    // Registering the new entitlements queues the system container's deletion; the
+    // command itself (one without a handler in this build) must not drop it.
+    auto r = daemon.run(after, {"regenerateDirectoryUUID", "ContainerClass=2"});
+    EXPECT_EQ(49u, r.code()) << r.err;
+    EXPECT_EQ(21u, daemon.run(before, {"createOrLookup", "ContainerClass=12"}).code());
+    EXPECT_NE(0, ::access(path->stringValue()->c_str(), F_OK)) << "moved to death row";
+    EXPECT_EQ(0, daemon.stop());
+}

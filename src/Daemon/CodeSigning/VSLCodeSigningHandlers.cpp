@@ -23,9 +23,12 @@ void processCodeSigningInfoCommand(const Value& request, const VSLReplyRef&, con
         *code = kVSLErrorDatabase;
         return;
     }
-    uint64_t result = mapping->processCodeSigningInfo(
-        dictionaryFromRequest(request, "CodeSigningInfo"), stringFromRequest(request, "Identifier"),
-        dictionaryFromRequest(request, "OptionsDictionary"), connection->commandQueue());
+    // An empty identifier names nothing: it is missing, not a record keyed "".
+    auto identifier = stringFromRequest(request, "Identifier");
+    if (identifier && identifier->empty()) identifier.reset();
+    uint64_t result = mapping->processCodeSigningInfo(dictionaryFromRequest(request, "CodeSigningInfo"), identifier,
+                                                      dictionaryFromRequest(request, "OptionsDictionary"),
+                                                      connection->commandQueue());
     if (result != kVSLSuccess) *code = result;
 }
 

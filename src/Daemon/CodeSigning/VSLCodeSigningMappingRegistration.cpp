@@ -163,7 +163,7 @@ uint64_t VSLCodeSigningMapping::_onQueue_processCodeSigningInfo(const std::optio
         }
         return kVSLSuccess;
     } catch (...) {
-        return codeForError(errorForCaughtException(__func__, __LINE__), kVSLErrorException);
+        return codeForError(errorForCaughtException(VSL_FUNCTION, __LINE__), kVSLErrorException);
     }
 }
 

@@ -5,6 +5,7 @@
 #include <mutex>
 
 #include "Daemon/CodeSigning/VSLSQLiteStatement.h"
+#include "Daemon/CodeSigning/VSLSQLiteTransaction.h"
 #include "Daemon/Core/VSLExceptionGuard.h"
 #include "Daemon/Core/VSLInvariant.h"
 #include "Platform/Log.h"
@@ -123,19 +124,7 @@ void VSLSQLiteDB::closeDB() {
     db_ = nullptr;
 }
 
-bool VSLSQLiteDB::_sqliteExec(const char* sql, VSLErrorRef* error) {
-    char* message = nullptr;
-    if (sqlite3_exec(db_, sql, nullptr, nullptr, &message) == SQLITE_OK) return true;
-    auto e = VSL_ERROR(kVSLErrorDatabase, nullptr, true, "%@ on %@ failed: %s", sql, url_, message ? message : "");
-    sqlite3_free(message);
-    return failWithError(error, e);
-}
-
-bool VSLSQLiteDB::_rollback(VSLErrorRef* error) {
-    VSLErrorRef underlying;
-    if (_sqliteExec("ROLLBACK;", &underlying)) return true;
-    return failWithError(error, VSL_ERROR(kVSLErrorDatabase, underlying, true, "failed _sqliteExec rollback"));
-}
+bool VSLSQLiteDB::_sqliteExec(const char* sql, VSLErrorRef* error) { return sqliteExec(db_, url_, sql, error); }
 
 // ---- writing ----
 
@@ -183,7 +172,7 @@ bool VSLSQLiteDB::_insertCodeSigningInfo(const VSLCodeSigningEntry& entry, const
                                          VSLErrorRef* error) {
     VSLErrorRef updateError;
     if (_performInsertOrUpdateQuery(kUpdateInfo, entry, identifier, true, &updateError)) return true;
-    if (!isErrorCode(updateError, kVSLErrorDatabaseChanges))
+    if (!errorHasCode(updateError, kVSLErrorDatabaseChanges))
         return failWithError(error, VSL_ERROR(kVSLErrorDatabase, updateError, true,
                                               "Error performing UPDATE operation for %@", identifier));
     VSLErrorRef insertError;
@@ -237,16 +226,13 @@ bool VSLSQLiteDB::addCodeSigningEntry(const VSLCodeSigningEntry* entry, const st
         return failWithError(error,
                              VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true,
                                        "codeSigningEntry %@ and identifier %@ cannot be nil", entry, identifier));
-    bool began = false;
+    VSLSQLiteTransaction transaction(db_, url_, VSL_FUNCTION);
     try {
-        VSLErrorRef execError;
-        if (!_sqliteExec("BEGIN;", &execError))
-            return failWithError(error, VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec begin"));
-        began = true;
+        if (!transaction.begin(error)) return false;
         VSLErrorRef stepError;
         if (!_insertCodeSigningInfo(*entry, *identifier, &stepError) ||
             !_insertCodeSigningData(*entry, *identifier, &stepError)) {
-            _rollback(&stepError);
+            transaction.rollback(&stepError);
             return failWithError(error, stepError);
         }
         if (entry->childBundleIdentifiers) {
@@ -259,12 +245,12 @@ bool VSLSQLiteDB::addCodeSigningEntry(const VSLCodeSigningEntry* entry, const st
                               child);
             }
         }
-        if (!_sqliteExec("COMMIT;", &execError))
-            VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec commit");
+        // A failed commit is logged and rolled back; the operation still succeeds.
+        transaction.commit(nullptr);
         return true;
     } catch (...) {
-        VSLErrorRef e = errorForCaughtException(__func__, __LINE__);
-        if (began) _rollback(&e);
+        VSLErrorRef e = errorForCaughtException(VSL_FUNCTION, __LINE__);
+        transaction.rollback(&e);
         return failWithError(error, e);
     }
 }
@@ -294,33 +280,30 @@ bool VSLSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identif
 bool VSLSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, VSLErrorRef* error) {
     VSLErrorRef childError;
     auto children = childIdentifiersForParentIdentifier(identifier, &childError);
-    if (!children && !isErrorCode(childError, kVSLErrorNotInDatabase))
+    if (!children && !errorHasCode(childError, kVSLErrorNotInDatabase))
         return failWithError(error, VSL_ERROR(kVSLErrorDatabase, childError, true,
                                               "Error retrieving child bundles ids from DB with identifier %@ : %@",
                                               identifier, childError));
     std::vector<std::string> list{identifier};
     if (children) list.insert(list.end(), children->begin(), children->end());
-    bool began = false;
+    VSLSQLiteTransaction transaction(db_, url_, VSL_FUNCTION);
     try {
-        VSLErrorRef execError;
-        if (!_sqliteExec("BEGIN;", &execError))
-            return failWithError(error, VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec begin"));
-        began = true;
+        if (!transaction.begin(error)) return false;
         for (const auto& item : list) {
             VSLErrorRef itemError;
             if (invalidateCodeSigningWithIdentifier(item, &itemError))
                 osLog(LogCategory::Database, OSLogLevel::Debug, "Invalidating code signing info for %@ child: %@",
                       identifier, item);
             else
-                LogWrite(kLogLevelError, __func__, "Failed to invalidate code signing info for %@ child %@ : %@",
+                LogWrite(kLogLevelError, VSL_FUNCTION, "Failed to invalidate code signing info for %@ child %@ : %@",
                          identifier, item, itemError);
         }
-        if (!_sqliteExec("COMMIT;", &execError))
-            VSL_ERROR(kVSLErrorDatabase, execError, true, "failed _sqliteExec commit");
+        // A failed commit is logged and rolled back; the operation still succeeds.
+        transaction.commit(nullptr);
         return true;
     } catch (...) {
-        VSLErrorRef e = errorForCaughtException(__func__, __LINE__);
-        if (began) _rollback(&e);
+        VSLErrorRef e = errorForCaughtException(VSL_FUNCTION, __LINE__);
+        transaction.rollback(&e);
         return failWithError(error, e);
     }
 }
@@ -334,7 +317,7 @@ bool VSLSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(VSLErrorRe
                              kFlagAdvanceCopy, url_, sqlite3_errmsg(db_)));
     if (!statement.stepToDone(error)) return false;
     int changes = sqlite3_changes(db_);
-    if (changes > 0) LogWrite(kLogLevelError, __func__, "Deleted %d advance copies of code signing info.", changes);
+    if (changes > 0) LogWrite(kLogLevelError, VSL_FUNCTION, "Deleted %d advance copies of code signing info.", changes);
     return true;
 }
 

@@ -78,8 +78,6 @@ private:
                                    const char* textOneFailureFormat, const std::string* textTwo, int expectedChanges,
                                    VSLErrorRef* error);
     std::optional<VSLCodeSigningEntry> _codeSigningEntryFromStatementRow(sqlite3_stmt* statement, VSLErrorRef* error);
-    // Rolls back an open transaction; false (with a code-66 error) when that fails.
-    bool _rollback(VSLErrorRef* error);
 
     sqlite3* db_;
     std::string url_;

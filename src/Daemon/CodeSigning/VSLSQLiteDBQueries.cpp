@@ -82,7 +82,7 @@ std::optional<VSLCodeSigningEntry> VSLSQLiteDB::codeSigningEntryWithIdentifier(c
                                                "Identifier: \"%@\" Not Found in DB", identifier));
                 return std::nullopt;
             }
-            LogWrite(kLogLevelError, __func__, "Error retrieving code signing entry: %@", selectError);
+            LogWrite(kLogLevelError, VSL_FUNCTION, "Error retrieving code signing entry: %@", selectError);
             failWithError(error, selectError);
             return std::nullopt;
         }
@@ -90,8 +90,8 @@ std::optional<VSLCodeSigningEntry> VSLSQLiteDB::codeSigningEntryWithIdentifier(c
     VSLErrorRef childError;
     if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
         entry->childBundleIdentifiers = std::move(children);
-    } else if (!isErrorCode(childError, kVSLErrorNotInDatabase)) {
-        LogWrite(kLogLevelError, __func__, "Error retrieving childBundleIds: %@", childError);
+    } else if (!errorHasCode(childError, kVSLErrorNotInDatabase)) {
+        LogWrite(kLogLevelError, VSL_FUNCTION, "Error retrieving childBundleIds: %@", childError);
         failWithError(error, childError);
         return std::nullopt;
     }
@@ -116,7 +116,7 @@ VSLErrorRef VSLSQLiteDB::enumerateIdentifiersAndCodeSigningInfoUsingBlock(const 
         VSLErrorRef childError;
         if (auto children = childIdentifiersForParentIdentifier(*identifier, &childError)) {
             entry->childBundleIdentifiers = std::move(children);
-        } else if (!isErrorCode(childError, kVSLErrorNotInDatabase)) {
+        } else if (!errorHasCode(childError, kVSLErrorNotInDatabase)) {
             result = VSL_ERROR(kVSLErrorDatabase, childError, true, "Error retrieving childBundleIds: %@", childError);
             continue;
         }

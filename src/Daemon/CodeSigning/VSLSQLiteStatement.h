@@ -18,10 +18,6 @@ inline bool failWithError(VSLErrorRef* out, VSLErrorRef error) {
     return false;
 }
 
-inline bool isErrorCode(const VSLErrorRef& e, uint64_t code) {
-    return e && e->isVSLDomain() && static_cast<uint64_t>(e->code) == code;
-}
-
 // Prepared statements of one connection, keyed by their text. Preparing is most of
 // the cost of a one-row query, and the daemon asks for the caller's entry on every
 // message.

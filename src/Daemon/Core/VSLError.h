@@ -7,6 +7,7 @@
 #include <memory>
 #include <optional>
 #include <string>
+#include <string_view>
 
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Platform/Log.h"
@@ -73,8 +74,20 @@ inline bool errorHasCode(const VSLErrorRef& error, int64_t code, const char* dom
 }
 inline bool isPOSIXError(const VSLErrorRef& error, int err) { return errorHasCode(error, err, VSLPOSIXErrorDomain); }
 
+// Never defined: calling it makes the build fail.
+void aLogLineInsideALambdaMustNameItsMethod();
+
+// The writer's name for a log line or an error. Inside a lambda __func__ is
+// "operator()", which tells a reader nothing: there the build fails, and the call
+// site names its method explicitly.
+consteval const char* writerFunctionName(const char* name) {
+    if (std::string_view(name) == "operator()") aLogLineInsideALambdaMustNameItsMethod();
+    return name;
+}
+
 }  // namespace vsl
 
+#define VSL_FUNCTION ::vsl::writerFunctionName(__func__)
 #define VSL_ERROR(code, underlying, log, ...) \
-    ::vsl::createVSLError(__func__, __LINE__, (code), (underlying), (log), __VA_ARGS__)
-#define VSL_POSIX_ERROR(err, ...) ::vsl::createPOSIXError(__func__, __LINE__, (err), __VA_ARGS__)
+    ::vsl::createVSLError(VSL_FUNCTION, __LINE__, (code), (underlying), (log), __VA_ARGS__)
+#define VSL_POSIX_ERROR(err, ...) ::vsl::createPOSIXError(VSL_FUNCTION, __LINE__, (err), __VA_ARGS__)

@@ -43,4 +43,4 @@ bool guardExceptions(const char* function, int line, VSLErrorRef* error, F&& bod
 
 }  // namespace vsl
 
-#define VSL_GUARD_EXCEPTIONS(errorOut, body) ::vsl::guardExceptions(__func__, __LINE__, (errorOut), (body))
+#define VSL_GUARD_EXCEPTIONS(errorOut, body) ::vsl::guardExceptions(VSL_FUNCTION, __LINE__, (errorOut), (body))

@@ -133,7 +133,8 @@ VSLMetadataRef VSLClientConnection::createOrLookupContainerWithContainerIdentity
               "unrestricted: %d, clientBundleIdentifier: %@",
               identity, createIfNecessary, transient, allowOtherIdLookup_, unrestricted_, clientBundleIdentifier());
         if (!identity) {
-            error = VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true, "Cannot lookup a nil container identity.");
+            error = createVSLError(kCreateFn, __LINE__, kVSLErrorInvalidArgument, nullptr, true,
+                                   "Cannot lookup a nil container identity.");
             return false;
         }
         uint64_t accessCode = 1;
@@ -160,8 +161,8 @@ VSLMetadataRef VSLClientConnection::createOrLookupContainerWithContainerIdentity
             }
         }
         if (!createIfNecessary) {
-            error = VSL_ERROR(kVSLErrorNotFound, nullptr, false, "Container with identifier: \"%@\" Not Found",
-                              identity->identifier());
+            error = createVSLError(kCreateFn, __LINE__, kVSLErrorNotFound, nullptr, false,
+                                   "Container with identifier: \"%@\" Not Found", identity->identifier());
             return false;
         }
 
@@ -175,8 +176,8 @@ VSLMetadataRef VSLClientConnection::createOrLookupContainerWithContainerIdentity
         if (raced) {
             VSLErrorRef moveError;
             if (!_moveItemAtURLToDeathRow(raced->url(), true, true, &moveError)) {
-                error = VSL_ERROR(kVSLErrorRemoveTransient, moveError, true, "Failed to remove transient container at %@",
-                                  raced->url());
+                error = createVSLError(kCreateFn, __LINE__, kVSLErrorRemoveTransient, moveError, true,
+                                       "Failed to remove transient container at %@", raced->url());
                 return false;
             }
         } else if (!isNotFound(secondError)) {
@@ -219,10 +220,12 @@ VSLMetadataRef VSLClientConnection::createContainer(const VSLContainerIdentityRe
     }
 
     // From here on a failure sends the staging directory to death row.
+    const char* const writer = VSL_FUNCTION;
     auto cleanUp = [&](VSLErrorRef failure) -> VSLMetadataRef {
         VSLErrorRef moveError;
         if (!_moveItemAtURLToDeathRow(staging, true, true, &moveError))
-            failure = VSL_ERROR(kVSLErrorRemoveStagingDir, moveError, true, "Failed to remove staging dir: %@", staging);
+            failure = createVSLError(writer, __LINE__, kVSLErrorRemoveStagingDir, moveError, true,
+                                     "Failed to remove staging dir: %@", staging);
         *error = failure;
         return nullptr;
     };
@@ -272,7 +275,7 @@ std::optional<std::vector<VSLMetadataRef>> VSLClientConnection::containersWithCl
     VSLGlobalLockGuard lock(true);
     lock.read();
     auto all = VSLContainerCache::sharedInstance()->allContainersForUserIdentity(
-        clientIdentity_ ? clientIdentity_->userIdentity() : nullptr, containerClass, transient, false, &error);
+        clientIdentity_ ? clientIdentity_->userIdentity() : nullptr, containerClass, transient, true, &error);
     lock.release();
     if (!all && code) *code = codeForError(error, kVSLErrorCacheRebuild);
     return all;

@@ -75,7 +75,8 @@ bool VSLClientConnection::_removeItemOrMoveToTempAtURL(const std::string& url, V
 void VSLClientConnection::deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion) {
     // Each pass lists the directory afresh, so overlapping requests only find leftovers.
     auto self = shared_from_this();
-    dispatchAsyncWithTransaction(deathRowQueue(), [self, completion = std::move(completion)] {
+    const char* const writer = VSL_FUNCTION;  // the work below writes in this method's name
+    dispatchAsyncWithTransaction(deathRowQueue(), [self, writer, completion = std::move(completion)] {
         auto& fm = VSLFileManager::defaultManager();
         std::string deathRow = VSLGlobalConfiguration::sharedInstance()->deathrowDirectory();
         VSLErrorRef recorded;
@@ -83,14 +84,14 @@ void VSLClientConnection::deleteContainersOnDeathRowWithCompletion(std::function
         auto items = fm.urlsForItemsInDirectoryAtURL(deathRow, &listError);
         if (!items) {
             if (!isNoSuchFile(listError))
-                recorded = VSL_ERROR(kVSLErrorDeleteContainer, listError, true, "Failed to get items for deletion: %@ : %@",
-                                     deathRow, listError);
+                recorded = createVSLError(writer, __LINE__, kVSLErrorDeleteContainer, listError, true,
+                                          "Failed to get items for deletion: %@ : %@", deathRow, listError);
         } else {
             for (const auto& item : *items) {
                 VSLErrorRef itemError;
                 if (!self->_removeItemOrMoveToTempAtURL(item.path, &itemError))
-                    recorded = VSL_ERROR(kVSLErrorDestroyDeathRowItem, itemError, true, "Failed to destroy item at: %@",
-                                         item.path);
+                    recorded = createVSLError(writer, __LINE__, kVSLErrorDestroyDeathRowItem, itemError, true,
+                                              "Failed to destroy item at: %@", item.path);
             }
         }
         if (completion) completion(recorded ? codeForError(recorded, kVSLErrorDestroyDeathRowItem) : kVSLSuccess);

@@ -22,7 +22,7 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {0, handleCreateOrLookup, A, 0x10101},
     {1, handleContainersWithClass, A, 0x10001},
     {2, nullptr, A, 0x1},
-    {3, nullptr, A, 0x1},
+    {3, handleStageContainerForDelete, A, 0x1},
     {4, handleDeleteContainersOnDeathRow, kVSLEntitlementUserManagedAssets, 0x0},
     {5, nullptr, A, 0x1},
     {6, nullptr, A, 0x1},

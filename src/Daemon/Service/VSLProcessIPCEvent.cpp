@@ -3,6 +3,7 @@
 #include "Client/VSLProtocol.h"
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/Core/VSLErrorCodes.h"
+#include "Daemon/Core/VSLExceptionGuard.h"
 #include "Daemon/Service/VSLCommandTable.h"
 #include "Daemon/Service/VSLEntitlements.h"
 #include "Platform/Log.h"
@@ -68,7 +69,33 @@ VSLClientConnectionRef checkEntitlementsAndInitClientObject(const VSLPeerCredent
     return nullptr;
 }
 
+// Runs `body`; an exception ends in code 40 (or stops an internal build) and false.
+template <class F>
+bool guarded(int line, uint64_t* code, F&& body) {
+    VSLErrorRef error;
+    if (guardExceptions(kFn, line, &error, [&] {
+            body();
+            return true;
+        }))
+        return true;
+    *code = codeForError(error, kVSLErrorException);
+    return false;
+}
+
 }  // namespace
+
+void runCommandRow(const VSLCommandRow& row, const Value& request, const VSLReplyRef& reply,
+                   const VSLClientConnectionRef& connection, uint64_t* code) {
+    if (!row.handler) {
+        LogWrite(kLogLevelError, kFn, "Command %llu (%s) is not available in this build", row.number,
+                 commandName(row.number));
+        *code = kVSLErrorInvalidCommand;
+    } else {
+        // A handler that threw may have written half its keys.
+        if (!guarded(__LINE__, code, [&] { row.handler(request, reply, connection, code); })) reply->discardValues();
+    }
+    guarded(__LINE__, code, [&] { connection->completeWithError(code); });
+}
 
 void VSLProcessIPCEvent(const VSLPeerCredentials& peer, const Value& request, VSLReply::Sender send,
                         const std::function<void()>& cancelPeer) {
@@ -97,16 +124,11 @@ void VSLProcessIPCEvent(const VSLPeerCredentials& peer, const Value& request, VS
     } else {
         const VSLCommandRow& row = commandRow(command);
         flags = row.flags;
-        connection = checkEntitlementsAndInitClientObject(peer, row);
-        if (!connection) {
+        guarded(__LINE__, &code, [&] { connection = checkEntitlementsAndInitClientObject(peer, row); });
+        if (connection)
+            runCommandRow(row, request, reply, connection, &code);
+        else if (code == kVSLSuccess)
             code = kVSLErrorNotEntitled;
-        } else if (!row.handler) {
-            LogWrite(kLogLevelError, kFn, "Command %llu (%s) is not available in this build", command, commandName(command));
-            code = kVSLErrorInvalidCommand;
-        } else {
-            row.handler(request, reply, connection, &code);
-            connection->completeWithError(&code);
-        }
     }
 
     std::string client = connection && connection->clientIdentity() ? connection->clientBundleIdentifier()

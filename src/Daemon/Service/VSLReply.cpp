@@ -17,6 +17,11 @@ Dictionary VSLReply::values() const {
     return values_;
 }
 
+void VSLReply::discardValues() {
+    std::lock_guard<std::mutex> g(mutex_);
+    values_.clear();
+}
+
 void VSLReply::sendWithCode(uint64_t code) {
     if (sent_.exchange(true)) return;
     Dictionary body;

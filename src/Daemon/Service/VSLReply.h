@@ -21,6 +21,8 @@ public:
     void set(const std::string& key, Value value);
     bool has(const std::string& key) const;
     Dictionary values() const;
+    // Forgets the keys set so far (a failed handler's partial answer).
+    void discardValues();
 
     // Sets "ReplyError" and sends; later calls do nothing (one reply per message).
     void sendWithCode(uint64_t code);

@@ -164,10 +164,12 @@ VSLMetadataRef VSLContainerCache::containerForContainerIdentity(const VSLContain
                                                                 bool transient, bool updateSandbox,
                                                                 bool allowKernelLookup, VSLErrorRef* error) {
     VSLMetadataRef result;
+    const char* const writer = VSL_FUNCTION;  // the lambda below writes in this method's name
     VSL_GUARD_EXCEPTIONS(error, [&] {
         assertNotOnCodeSigningQueue();
         if (!identity) {
-            auto e = VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true, "Cannot lookup a nil container identity.");
+            auto e = createVSLError(writer, __LINE__, kVSLErrorInvalidArgument, nullptr, true,
+                                    "Cannot lookup a nil container identity.");
             if (error) *error = e;
             return false;
         }
@@ -184,15 +186,16 @@ VSLMetadataRef VSLContainerCache::containerForContainerIdentity(const VSLContain
                 VSLErrorRef buildError;
                 if (!_lock_getCache(*index, key, userIdentity, containerClass, transient, updateSandbox, true,
                                     &buildError)) {
-                    auto e = rebuildError(__func__, __LINE__, userIdentity, containerClass, transient, buildError);
+                    auto e = rebuildError(writer, __LINE__, userIdentity, containerClass, transient, buildError);
                     if (error) *error = e;
                     return false;
                 }
                 auto it = index->records.find(identity->identifier());
                 if (it == index->records.end()) {
-                    auto e = VSL_ERROR(kVSLErrorNotFound, nullptr, true, "Cache: %@%@: Container Not Found with ID: %@",
-                                       containerClassDirectoryName(containerClass), transientMarker(transient),
-                                       identity->identifier());
+                    auto e = createVSLError(writer, __LINE__, kVSLErrorNotFound, nullptr, true,
+                                            "Cache: %@%@: Container Not Found with ID: %@",
+                                            containerClassDirectoryName(containerClass), transientMarker(transient),
+                                            identity->identifier());
                     if (error) *error = e;
                     return false;
                 }
@@ -287,10 +290,11 @@ std::optional<std::vector<VSLMetadataRef>> VSLContainerCache::allContainersForUs
     const VSLUserIdentityRef& userIdentity, VSLContainerClass containerClass, bool transient,
     bool populateSandboxCache, VSLErrorRef* error) {
     std::optional<std::vector<VSLMetadataRef>> result;
+    const char* const writer = VSL_FUNCTION;  // the lambda below writes in this method's name
     VSL_GUARD_EXCEPTIONS(error, [&] {
         if (!isValidContainerClass(containerClass)) {
-            auto e = VSL_ERROR(kVSLErrorCacheInvalidInput, nullptr, true, "Invalid Content Class: %ld",
-                               static_cast<int64_t>(containerClass));
+            auto e = createVSLError(writer, __LINE__, kVSLErrorCacheInvalidInput, nullptr, true,
+                                    "Invalid Content Class: %ld", static_cast<int64_t>(containerClass));
             if (error) *error = e;
             return false;
         }
@@ -310,7 +314,7 @@ std::optional<std::vector<VSLMetadataRef>> VSLContainerCache::allContainersForUs
             VSLErrorRef buildError;
             if (!_lock_getCache(*index, key, identity, containerClass, transient, populateSandboxCache, true,
                                 &buildError)) {
-                auto e = rebuildError(__func__, __LINE__, identity, containerClass, transient, buildError);
+                auto e = rebuildError(writer, __LINE__, identity, containerClass, transient, buildError);
                 if (error) *error = e;
                 return false;
             }
@@ -331,16 +335,19 @@ std::optional<std::vector<VSLMetadataRef>> VSLContainerCache::allContainersForUs
 
 bool VSLContainerCache::addContainerMetadata(const VSLMetadataRef& metadata, const std::string& url, bool transient,
                                              bool updateSandbox, VSLErrorRef* error) {
+    const char* const writer = VSL_FUNCTION;  // the lambda below writes in this method's name
     return VSL_GUARD_EXCEPTIONS(error, [&] {
         VSLErrorRef e;
         const VSLContainerClass containerClass = metadata ? metadata->containerClass() : kVSLClassUndefined;
         if (!isValidContainerClass(containerClass))
-            e = VSL_ERROR(kVSLErrorCacheInvalidInput, nullptr, true, "Invalid Metadata Content Class: %lld",
-                          static_cast<int64_t>(containerClass));
+            e = createVSLError(writer, __LINE__, kVSLErrorCacheInvalidInput, nullptr, true,
+                               "Invalid Metadata Content Class: %lld", static_cast<int64_t>(containerClass));
         else if (metadata->identifier().empty())
-            e = VSL_ERROR(kVSLErrorCacheInvalidInput, nullptr, true, "Invalid metadata Identifier: %@", nullptr);
+            e = createVSLError(writer, __LINE__, kVSLErrorCacheInvalidInput, nullptr, true,
+                               "Invalid metadata Identifier: %@", nullptr);
         else if (url.empty())
-            e = VSL_ERROR(kVSLErrorCacheInvalidInput, nullptr, true, "Invalid input: URL: %@", nullptr);
+            e = createVSLError(writer, __LINE__, kVSLErrorCacheInvalidInput, nullptr, true, "Invalid input: URL: %@",
+                               nullptr);
         if (e) {
             if (error) *error = e;
             return false;
@@ -356,7 +363,7 @@ bool VSLContainerCache::addContainerMetadata(const VSLMetadataRef& metadata, con
             if (!_lock_getCache(*index, key, userIdentity, containerClass, transient, updateSandbox, updateSandbox,
                                 &buildError)) {
                 if (!updateSandbox) return true;  // the next lookup reads it from disk
-                e = rebuildError(__func__, __LINE__, userIdentity, containerClass, transient, buildError);
+                e = rebuildError(writer, __LINE__, userIdentity, containerClass, transient, buildError);
                 if (error) *error = e;
                 return false;
             }
@@ -367,9 +374,9 @@ bool VSLContainerCache::addContainerMetadata(const VSLMetadataRef& metadata, con
         }
         if (updateSandbox && !transient && registers &&
             !setSandboxContainerMappingForUserIdentity(userIdentity, metadata->identifier(), containerClass, url))
-            LogWrite(kLogLevelError, __func__, "Failed to set container mapping of %@, %llu", metadata->identifier(),
+            LogWrite(kLogLevelError, writer, "Failed to set container mapping of %@, %llu", metadata->identifier(),
                      containerClass);
-        LogWrite(kLogLevelDebug, __func__, "Cache: %@%@: Added Identifier: %@",
+        LogWrite(kLogLevelDebug, writer, "Cache: %@%@: Added Identifier: %@",
                  containerClassDirectoryName(containerClass), transientMarker(transient), metadata->identifier());
         return true;
     });
@@ -378,13 +385,15 @@ bool VSLContainerCache::addContainerMetadata(const VSLMetadataRef& metadata, con
 bool VSLContainerCache::removeContainerForUserIdentity(const VSLUserIdentityRef& userIdentity,
                                                        VSLContainerClass containerClass, const std::string& identifier,
                                                        bool transient, VSLErrorRef* error) {
+    const char* const writer = VSL_FUNCTION;  // the lambda below writes in this method's name
     return VSL_GUARD_EXCEPTIONS(error, [&] {
         VSLErrorRef e;
         if (!isValidContainerClass(containerClass))
-            e = VSL_ERROR(kVSLErrorCacheInvalidInput, nullptr, true, "Invalid Content Class: %ld",
-                          static_cast<int64_t>(containerClass));
+            e = createVSLError(writer, __LINE__, kVSLErrorCacheInvalidInput, nullptr, true,
+                               "Invalid Content Class: %ld", static_cast<int64_t>(containerClass));
         else if (identifier.empty())
-            e = VSL_ERROR(kVSLErrorCacheInvalidInput, nullptr, true, "Invalid Identifier: %@", nullptr);
+            e = createVSLError(writer, __LINE__, kVSLErrorCacheInvalidInput, nullptr, true, "Invalid Identifier: %@",
+                               nullptr);
         if (e) {
             if (error) *error = e;
             return false;
@@ -397,7 +406,7 @@ bool VSLContainerCache::removeContainerForUserIdentity(const VSLUserIdentityRef&
             std::lock_guard<std::mutex> lock(index->mutex);
             VSLErrorRef buildError;
             if (!_lock_getCache(*index, key, userIdentity, containerClass, transient, true, true, &buildError)) {
-                e = rebuildError(__func__, __LINE__, userIdentity, containerClass, transient, buildError);
+                e = rebuildError(writer, __LINE__, userIdentity, containerClass, transient, buildError);
                 if (error) *error = e;
                 return false;
             }
@@ -406,9 +415,9 @@ bool VSLContainerCache::removeContainerForUserIdentity(const VSLUserIdentityRef&
         }
         if (registers && !transient &&
             !setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, std::nullopt))
-            LogWrite(kLogLevelError, __func__, "Failed to remove container mapping of %@, %llu", identifier,
+            LogWrite(kLogLevelError, writer, "Failed to remove container mapping of %@, %llu", identifier,
                      containerClass);
-        LogWrite(kLogLevelDebug, __func__, "Cache: %@%@: Removed Identifier: %@",
+        LogWrite(kLogLevelDebug, writer, "Cache: %@%@: Removed Identifier: %@",
                  containerClassDirectoryName(containerClass), transientMarker(transient), identifier);
         return true;
     });
@@ -418,30 +427,27 @@ bool VSLContainerCache::removeContainerForUserIdentity(const VSLUserIdentityRef&
 
 void VSLContainerCache::invalidateUserIdentity(const VSLUserIdentityRef& userIdentity) {
     assertNotOnCodeSigningQueue();
-    std::vector<std::pair<VSLContainerClass, std::shared_ptr<ClassIndex>>> dropped;
+    std::vector<std::pair<VSLContainerClass, std::shared_ptr<ClassIndex>>> live;
     {
         std::lock_guard<std::mutex> lock(cacheLock_);
         for (VSLContainerClass c = 1; c <= 13; c++) {
             const std::string key = _cacheKeyForUserIdentity(userIdentity, c);
-            if (auto it = liveContainerCache_.find(key); it != liveContainerCache_.end()) {
-                dropped.emplace_back(c, std::move(it->second));
-                liveContainerCache_.erase(it);
-            }
+            if (auto it = liveContainerCache_.find(key); it != liveContainerCache_.end())
+                live.emplace_back(c, it->second);
             transientContainerCache_.erase(key);
         }
     }
-    // A rebuild still running on a dropped index finishes first; its records then
-    // leave the kernel state with the rest.
-    for (const auto& [containerClass, index] : dropped) {
-        std::vector<std::string> identifiers;
-        {
-            std::lock_guard<std::mutex> lock(index->mutex);
-            for (const auto& [identifier, metadata] : index->records) identifiers.push_back(identifier);
-        }
-        for (const auto& identifier : identifiers)
+    // A live index is emptied in place, its sandbox items removed under its mutex: a
+    // rebuild of the key (running now, or the next one) holds that mutex too, so the
+    // items it pushes can never be removed by this invalidation afterwards.
+    for (const auto& [containerClass, index] : live) {
+        std::lock_guard<std::mutex> lock(index->mutex);
+        for (const auto& [identifier, metadata] : index->records)
             if (!setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, std::nullopt))
-                LogWrite(kLogLevelError, __func__, "Failed to remove container mapping of [%@], class: %llu",
+                LogWrite(kLogLevelError, VSL_FUNCTION, "Failed to remove container mapping of [%@], class: %llu",
                          identifier, containerClass);
+        index->records.clear();
+        index->built = false;
     }
     uint32_t status = hooks_.postUserInvalidatedNotification ? hooks_.postUserInvalidatedNotification() : 0;
     if (status != 0)

@@ -43,21 +43,21 @@ bool VSLContainerCache::setSandboxContainerMappingForUserIdentity(const VSLUserI
     if (isBundleContainerClass(containerClass)) return true;
     auto target = sandboxTarget(userIdentity, containerClass);
     if (!target) {
-        LogWrite(kLogLevelError, __func__, "Unsupported class for setting sandbox container mapping: %llu",
+        LogWrite(kLogLevelError, VSL_FUNCTION, "Unsupported class for setting sandbox container mapping: %llu",
                  containerClass);
         return false;
     }
     const int32_t personaID = personaIDOf(userIdentity);
     const char* path = url ? url->c_str() : nullptr;
     if (int rc = SandboxState::setItem(target->uid, {target->itemType, personaID, identifier, std::nullopt})) {
-        LogWrite(kLogLevelError, __func__,
+        LogWrite(kLogLevelError, VSL_FUNCTION,
                  "Failed to remove mapping for user: %u, itemType: %llu, identifier: %s, class: %llu, path: %s : %d",
                  target->uid, target->itemType, identifier, containerClass, path, rc);
         return false;
     }
     if (url) {
         if (int rc = SandboxState::setItem(target->uid, {target->itemType, personaID, identifier, *url})) {
-            LogWrite(kLogLevelError, __func__,
+            LogWrite(kLogLevelError, VSL_FUNCTION,
                      "Failed to set mapping for user: %u, itemType: %llu, identifier %s, class: %llu, path: %s : %d",
                      target->uid, target->itemType, identifier, containerClass, path, rc);
             return false;
@@ -83,7 +83,7 @@ void VSLContainerCache::pushSandboxItems(const VSLUserIdentityRef& userIdentity,
     int rc = SandboxState::setItems(target->uid, changes);
     for (const auto& change : changes) {
         if (rc != 0)
-            LogWrite(kLogLevelError, __func__,
+            LogWrite(kLogLevelError, VSL_FUNCTION,
                      "Failed to set container mapping during create/lookup operation of %@, %llu", change.identifier,
                      containerClass);
         else
@@ -156,10 +156,10 @@ VSLMetadataRef VSLContainerCache::_lock_metadataFromSandboxForContainerIdentity(
         auto metadata = VSLMetadata::readAndValidateMetadataAtUrl(*candidate, userIdentity, true, &error,
                                                                   userIdentityCache_.get());
         if (!metadata) {
-            LogWrite(kLogLevelError, __func__, "Could not validate container from Sandbox-provided path [%@]; error = %@",
-                     *candidate, error);
+            LogWrite(kLogLevelError, VSL_FUNCTION,
+                     "Could not validate container from Sandbox-provided path [%@]; error = %@", *candidate, error);
         } else if (metadata->containerClass() != containerClass || metadata->identifier() != identity.identifier()) {
-            LogWrite(kLogLevelError, __func__,
+            LogWrite(kLogLevelError, VSL_FUNCTION,
                      "Attempted to fetch container from Sandbox-provided path [%@] that was not what was expected; "
                      "expected class: %llu, expected identifier: [%@], actual class: %llu, actual identifier: [%@]",
                      *candidate, containerClass, identity.identifier(), metadata->containerClass(),

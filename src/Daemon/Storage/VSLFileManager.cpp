@@ -253,8 +253,10 @@ bool VSLFileManager::itemDoesNotExistAtURL(const std::string& url) const {
 
 std::optional<std::vector<VSLItemURL>> VSLFileManager::urlsForItemsInDirectoryAtURL(const std::string& url,
                                                                                      VSLErrorRef* error) const {
+    const char* const writer = VSL_FUNCTION;
     auto failure = [&](int err) {
-        setError(error, VSL_POSIX_ERROR(err, "_IterateDirectory for %@ returned %s", url, std::strerror(err)));
+        setError(error, createPOSIXError(writer, __LINE__, err, "_IterateDirectory for %@ returned %s", url,
+                                         std::strerror(err)));
         return std::nullopt;
     };
     int fd = ::open(url.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
@@ -313,13 +315,14 @@ bool VSLFileManager::_traverseDirectory(const std::string& url, VSLErrorRef* err
     uint64_t nodes = 0;
     bool completed = true;
     TreeWalkFailure where;
+    const char* const writer = VSL_FUNCTION;
     int rc = walkTree(
         url,
         [&](FTSENT* node) {
             nodes++;
             if (node->fts_info == FTS_ERR || node->fts_info == FTS_DNR) {
-                setError(error, VSL_POSIX_ERROR(node->fts_errno, "Error for path %s: %s", node->fts_path,
-                                                std::strerror(node->fts_errno)));
+                setError(error, createPOSIXError(writer, __LINE__, node->fts_errno, "Error for path %s: %s",
+                                                 node->fts_path, std::strerror(node->fts_errno)));
                 completed = false;
                 return false;
             }

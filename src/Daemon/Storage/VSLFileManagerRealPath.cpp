@@ -115,7 +115,8 @@ std::optional<std::string> VSLFileManager::realPathForURL(const std::string& sus
                                                           const std::string& baseURL, VSLErrorRef* error) const {
     auto reject = [&](std::string message) -> std::optional<std::string> {
         LogWrite(kLogLevelError, kRealPathFunction, "%@", message);
-        if (error) *error = VSL_ERROR(kVSLErrorInvalidPath, nullptr, false, "%@", message);
+        if (error)
+            *error = createVSLError(kRealPathFunction, __LINE__, kVSLErrorInvalidPath, nullptr, false, "%@", message);
         return std::nullopt;
     };
     if (suspiciousURL.empty() || baseURL.empty())
