@@ -24,28 +24,38 @@ std::vector<std::string> asUser(uid_t uid) {
     return {"/usr/bin/setpriv", "--reuid=" + id, "--regid=" + id, "--clear-groups"};
 }
 
-// `vesseld --root ROOT --init` under `prefix`; SIGTERM ends it.
-pid_t startDaemon(const std::vector<std::string>& prefix, const std::string& root) {
-    std::vector<std::string> args = prefix;
-    for (std::string a : {vesseldPath(), std::string("--root"), root, std::string("--init")}) args.push_back(a);
-    pid_t pid = ::fork();
-    if (pid == 0) {
-        std::vector<char*> argv;
-        for (auto& s : args) argv.push_back(s.data());
-        argv.push_back(nullptr);
-        ::setenv("VESSELD_OSLOG", "off", 1);
-        ::execv(argv[0], argv.data());
-        ::_exit(127);
+// `vesseld --root ROOT --init` under `prefix`, stopped with SIGTERM at the latest
+// when the test leaves, whichever way.
+class Daemon {
+public:
+    Daemon(const std::vector<std::string>& prefix, const std::string& root) {
+        std::vector<std::string> args = prefix;
+        for (std::string a : {vesseldPath(), std::string("--root"), root, std::string("--init")}) args.push_back(a);
+        pid_ = ::fork();
+        if (pid_ == 0) {
+            std::vector<char*> argv;
+            for (auto& s : args) argv.push_back(s.data());
+            argv.push_back(nullptr);
+            ::setenv("VESSELD_OSLOG", "off", 1);
+            ::execv(argv[0], argv.data());
+            ::_exit(127);
+        }
     }
-    return pid;
-}
+    ~Daemon() { stop(); }
 
-int stopDaemon(pid_t pid) {
-    ::kill(pid, SIGTERM);
-    int ws = 0;
-    ::waitpid(pid, &ws, 0);
-    return WIFEXITED(ws) ? WEXITSTATUS(ws) : -1;
-}
+    // The exit status, or -1.
+    int stop() {
+        if (pid_ <= 0) return -1;
+        ::kill(pid_, SIGTERM);
+        int ws = 0;
+        ::waitpid(pid_, &ws, 0);
+        pid_ = -1;
+        return WIFEXITED(ws) ? WEXITSTATUS(ws) : -1;
+    }
+
+private:
+    pid_t pid_ = -1;
+};
 
 // vesselctl under `prefix`, retried while the daemon is still starting (exit 3).
 int runCtl(const std::vector<std::string>& prefix, const std::string& root, const std::vector<std::string>& args,
@@ -82,7 +92,7 @@ TEST(Newcomer, InitThenPersonaUniqueStringsWithoutRoot) {
     std::string root = parent + "/x";
     ::chmod(parent.c_str(), 0777);
 
-    pid_t pid = startDaemon(prefix, root);
+    Daemon daemon(prefix, root);
     std::string out;
     EXPECT_EQ(0, runCtl(prefix, root, {"personaUniqueStrings"}, &out)) << out;
     EXPECT_NE(std::string::npos, out.find("ReplyError: 1\n")) << out;
@@ -93,7 +103,7 @@ TEST(Newcomer, InitThenPersonaUniqueStringsWithoutRoot) {
     if (!prefix.empty()) {
         EXPECT_EQ(65534u, st.st_uid) << "everything was made by the unprivileged user";
     }
-    EXPECT_EQ(0, stopDaemon(pid)) << "SIGTERM ends it cleanly";
+    EXPECT_EQ(0, daemon.stop()) << "SIGTERM ends it cleanly";
     removeTree(parent);
 }
 
@@ -107,7 +117,7 @@ TEST(Newcomer, EveryClassWithoutRoot) {
     ASSERT_EQ(0, ::chown(parent.c_str(), user, user));
     std::string root = parent + "/x";
 
-    pid_t pid = startDaemon(prefix, root);
+    Daemon daemon(prefix, root);
     for (int c = 1; c <= 13; c++) {
         SCOPED_TRACE("class " + std::to_string(c));
         std::string identifier = "com.example.newcomer" + std::to_string(c);
@@ -136,7 +146,7 @@ TEST(Newcomer, EveryClassWithoutRoot) {
             << again;
         EXPECT_EQ(path, lineValue(again, "ReplyPath")) << again;
     }
-    EXPECT_EQ(0, stopDaemon(pid));
+    EXPECT_EQ(0, daemon.stop());
 
     std::string log = readFile(root + "/private/var/root/Library/Logs/Vesselry/vesseld.log");
     size_t first = log.find("Running without root");
