@@ -1,5 +1,7 @@
 #include "Platform/DeviceFacts.h"
 
+#include <unistd.h>
+
 #include <fstream>
 #include <iterator>
 #include <memory>
@@ -20,6 +22,7 @@ std::string readAll(const std::string& path) {
 
 DeviceFacts load() {
     DeviceFacts f;
+    if (uid_t self = ::geteuid(); self != 0) f.installerUID = f.systemContainerUID = self;
     std::string bytes = readAll(rootedPath("/etc/vesseld/device.plist"));
     if (!bytes.empty()) {
         if (auto v = decodePropertyList(bytes.data(), bytes.size(), nullptr); v && v->isDictionary()) {

@@ -7,6 +7,7 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <fstream>
 #include <thread>
 
 #include "Support/DaemonProcess.h"
@@ -97,6 +98,14 @@ TEST(Newcomer, InitThenPersonaUniqueStringsWithoutRoot) {
     EXPECT_EQ(0, runCtl(prefix, root, {"personaUniqueStrings"}, &out)) << out;
     EXPECT_NE(std::string::npos, out.find("ReplyError: 1\n")) << out;
     EXPECT_NE(std::string::npos, out.find("ReplyPersonaUniqueStringsArray")) << out;
+    for (const char* c : {"1", "12"}) {
+        std::string made;
+        EXPECT_EQ(0, runCtl(prefix, root,
+                            {"createOrLookup", "Identifier=com.example.first", std::string("ContainerClass=") + c,
+                             "CreateIfNecessary=true"},
+                            &made))
+            << "class " << c << ": the owners --init wrote can be given: " << made;
+    }
 
     struct stat st;
     ASSERT_EQ(0, ::stat(root.c_str(), &st));
@@ -116,6 +125,13 @@ TEST(Newcomer, EveryClassWithoutRoot) {
     std::string parent = makeTempDir("vessel-newcomer-");
     ASSERT_EQ(0, ::chown(parent.c_str(), user, user));
     std::string root = parent + "/x";
+    // No owners in the device facts: their defaults serve.
+    std::string out, err;
+    ASSERT_EQ(0, runProgram({"/bin/mkdir", "-p", root + "/etc/vesseld"}, &out, &err)) << err;
+    std::ofstream(root + "/etc/vesseld/device.plist")
+        << "<plist version=\"1.0\"><dict><key>MultiUser</key><false/></dict></plist>\n";
+    ASSERT_EQ(0, runProgram({"/bin/chown", "-R", std::to_string(user) + ":" + std::to_string(user), root}, &out, &err))
+        << err;
 
     Daemon daemon(prefix, root);
     for (int c = 1; c <= 13; c++) {
