@@ -28,6 +28,9 @@ struct DeviceFacts {
 };
 
 const DeviceFacts& deviceFacts();
+// What installerUID and systemContainerUID are when device.plist names none.
+uid_t defaultInstallerUID();
+uid_t defaultSystemContainerUID();
 void reloadDeviceFacts();
 
 }  // namespace vsl

@@ -78,8 +78,8 @@ bool initializeScratchRoot(std::string* error) {
     bool asRoot = ::geteuid() == 0;
     uid_t uid = asRoot ? 501 : ::geteuid();
     gid_t gid = asRoot ? 501 : ::getegid();
-    uid_t installer = asRoot ? 33 : ::geteuid();
-    uid_t system = asRoot ? 0 : ::geteuid();
+    uid_t installer = defaultInstallerUID();
+    uid_t system = defaultSystemContainerUID();
     gid_t systemUsers = asRoot ? 95 : ::getegid();
     std::string u = std::to_string(uid), g = std::to_string(gid);
 
