@@ -77,6 +77,12 @@ int runCtl(const std::vector<std::string>& prefix, const std::string& root, cons
     return status;
 }
 
+// Declared before the daemon, so the daemon stops before its root goes.
+struct RemovedOnExit {
+    std::string path;
+    ~RemovedOnExit() { removeTree(path); }
+};
+
 std::string lineValue(const std::string& out, const std::string& key) {
     auto at = out.find(key + ": ");
     if (at == std::string::npos) return {};
@@ -90,6 +96,7 @@ TEST(Newcomer, InitThenPersonaUniqueStringsWithoutRoot) {
     if (::geteuid() == 0 && ::access("/usr/bin/setpriv", X_OK) != 0) GTEST_SKIP() << "needs setpriv to drop root";
     auto prefix = asUser(65534);
     std::string parent = makeTempDir("vessel-newcomer-");
+    RemovedOnExit removed{parent};
     std::string root = parent + "/x";
     ::chmod(parent.c_str(), 0777);
 
@@ -113,7 +120,6 @@ TEST(Newcomer, InitThenPersonaUniqueStringsWithoutRoot) {
         EXPECT_EQ(65534u, st.st_uid) << "everything was made by the unprivileged user";
     }
     EXPECT_EQ(0, daemon.stop()) << "SIGTERM ends it cleanly";
-    removeTree(parent);
 }
 
 // Bundle, data, group and system containers alike: the defaults of --init give every
@@ -123,6 +129,7 @@ TEST(Newcomer, EveryClassWithoutRoot) {
     const uid_t user = ::geteuid() == 0 ? 501 : ::geteuid();
     auto prefix = asUser(user);
     std::string parent = makeTempDir("vessel-newcomer-");
+    RemovedOnExit removed{parent};
     ASSERT_EQ(0, ::chown(parent.c_str(), user, user));
     std::string root = parent + "/x";
     // No owners in the device facts: their defaults serve.
@@ -170,5 +177,4 @@ TEST(Newcomer, EveryClassWithoutRoot) {
         EXPECT_NE(std::string::npos, first) << log;
         EXPECT_EQ(std::string::npos, log.find("Running without root", first + 1)) << "logged once";
     }
-    removeTree(parent);
 }
