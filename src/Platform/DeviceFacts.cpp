@@ -1,5 +1,7 @@
 #include "Platform/DeviceFacts.h"
 
+#include <unistd.h>
+
 #include <fstream>
 #include <iterator>
 #include <memory>
@@ -20,6 +22,8 @@ std::string readAll(const std::string& path) {
 
 DeviceFacts load() {
     DeviceFacts f;
+    f.installerUID = defaultInstallerUID();
+    f.systemContainerUID = defaultSystemContainerUID();
     std::string bytes = readAll(rootedPath("/etc/vesseld/device.plist"));
     if (!bytes.empty()) {
         if (auto v = decodePropertyList(bytes.data(), bytes.size(), nullptr); v && v->isDictionary()) {
@@ -54,6 +58,10 @@ std::mutex gMutex;
 std::shared_ptr<const DeviceFacts> gFacts;
 
 }  // namespace
+
+uid_t defaultInstallerUID() { return ::geteuid() == 0 ? 33 : ::geteuid(); }
+
+uid_t defaultSystemContainerUID() { return ::geteuid(); }
 
 const DeviceFacts& deviceFacts() {
     std::lock_guard<std::mutex> g(gMutex);

@@ -15,6 +15,8 @@ struct DeviceFacts {
     bool personasSupported = false;
     bool ephemeralStorage = false;
     std::map<std::string, bool> featureFlags;
+    // Without either key: 33 and 0 for a daemon running as root, else the daemon's own
+    // uid, which is the only owner an unprivileged daemon can give.
     uid_t installerUID = 33;
     uid_t systemContainerUID = 0;
     std::string buildVersion;  // BUILD_ID of etc/os-release, "" when absent
@@ -26,6 +28,9 @@ struct DeviceFacts {
 };
 
 const DeviceFacts& deviceFacts();
+// What installerUID and systemContainerUID are when device.plist names none.
+uid_t defaultInstallerUID();
+uid_t defaultSystemContainerUID();
 void reloadDeviceFacts();
 
 }  // namespace vsl

@@ -14,6 +14,7 @@
 #include "Platform/DirectoryEntries.h"
 #include "Platform/DurableIO.h"
 #include "Platform/SystemRoot.h"
+#include "Platform/UniqueFd.h"
 
 namespace vsl {
 
@@ -51,6 +52,19 @@ const std::string& bootID() {
 }
 
 std::string tablePath(uid_t uid) { return joinPath(SandboxState::directory(), "uid-" + std::to_string(uid)); }
+
+// Tables hold paths below the system root without the root ("private/var/..."), and
+// any other path as it is (absolute). With "/" as the root every path is absolute.
+std::optional<std::string> storedPath(const std::optional<std::string>& hostPath) {
+    if (!hostPath || systemRootIsSlash()) return hostPath;
+    std::string inside = unrootedPath(*hostPath);
+    if (inside == *hostPath) return hostPath;
+    return inside.substr(1);
+}
+
+std::string hostPath(const std::string& stored) {
+    return stored.empty() || stored[0] == '/' ? stored : rootedPath(stored);
+}
 
 void putU32(std::string& out, uint32_t v) {
     for (int i = 0; i < 4; i++) out.push_back(static_cast<char>(v >> (8 * i)));
@@ -157,32 +171,23 @@ bool sameFile(const struct stat& st, const Table& t) {
 
 int load(const std::string& path, Table& t) {
     t = Table();
-    int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW);
-    if (fd < 0) {
+    UniqueFd fd(::open(path.c_str(), O_RDONLY | O_CLOEXEC | O_NOFOLLOW));
+    if (!fd) {
         if (errno != ENOENT) return errno;
         t.loaded = true;
         return 0;
     }
     struct stat st;
-    if (::fstat(fd, &st) != 0) {
-        int err = errno;
-        ::close(fd);
-        return err;
-    }
+    if (::fstat(fd.get(), &st) != 0) return errno;
     std::string bytes(static_cast<size_t>(st.st_size), '\0');
     size_t got = 0;
     while (got < bytes.size()) {
-        ssize_t n = ::read(fd, bytes.data() + got, bytes.size() - got);
+        ssize_t n = ::read(fd.get(), bytes.data() + got, bytes.size() - got);
         if (n < 0 && errno == EINTR) continue;
-        if (n < 0) {
-            int err = errno;
-            ::close(fd);
-            return err;
-        }
+        if (n < 0) return errno;
         if (n == 0) break;
         got += static_cast<size_t>(n);
     }
-    ::close(fd);
     bytes.resize(got);
     t.loaded = true;
     remember(st, t);
@@ -251,26 +256,36 @@ int append(const std::string& path, Table& t, const std::vector<SandboxContainer
     std::string bytes;
     for (const auto& c : changes) appendRecord(bytes, c);
     durable::step("write", path);
-    int fd = ::open(path.c_str(), O_WRONLY | O_APPEND | O_CLOEXEC | O_NOFOLLOW);
-    if (fd < 0) return errno;
+    UniqueFd fd(::open(path.c_str(), O_WRONLY | O_APPEND | O_CLOEXEC | O_NOFOLLOW));
+    if (!fd) return errno;
     size_t done = 0;
     while (done < bytes.size()) {
-        ssize_t n = ::write(fd, bytes.data() + done, bytes.size() - done);
+        ssize_t n = ::write(fd.get(), bytes.data() + done, bytes.size() - done);
         if (n < 0 && errno == EINTR) continue;
-        if (n < 0) {
-            int err = errno;
-            ::close(fd);
-            return err;
-        }
+        if (n < 0) return errno;
         done += static_cast<size_t>(n);
     }
     struct stat st;
-    int rc = ::fstat(fd, &st) == 0 ? 0 : errno;
-    ::close(fd);
-    if (rc) return rc;
+    if (::fstat(fd.get(), &st) != 0) return errno;
     remember(st, t);
     t.records += changes.size();
     return 0;
+}
+
+// Removes the directory's entries that `which` picks; the caller holds gMutex.
+int removeEntries(const std::function<bool(const std::string&)>& which) {
+    std::string dir = SandboxState::directory();
+    UniqueFd fd(::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC | O_NOFOLLOW));
+    if (!fd) return errno == ENOENT ? 0 : errno;
+    std::vector<DirectoryEntry> entries;
+    if (int rc = readDirectoryEntries(fd.get(), &entries)) return rc;
+    int rc = 0;
+    for (const auto& e : entries) {
+        if (!which(e.name)) continue;
+        int err = durable::removeFile(joinPath(dir, e.name));
+        if (err != 0 && err != ENOENT && rc == 0) rc = err;
+    }
+    return rc;
 }
 
 }  // namespace
@@ -285,8 +300,10 @@ int SandboxState::setItems(uid_t uid, const std::vector<SandboxContainerItemChan
     Table& t = gTables[path];
     if (int rc = refresh(path, t)) return rc;
     std::vector<SandboxContainerItemChange> effective;
-    for (const auto& c : changes)
-        if (apply(t, c)) effective.push_back(c);
+    for (auto c : changes) {
+        c.path = storedPath(c.path);
+        if (apply(t, c)) effective.push_back(std::move(c));
+    }
     if (effective.empty()) return 0;
     // Appending after a torn record would hide everything after it; compact instead.
     bool whole = t.ino == 0 || t.rewrite || t.records + effective.size() > 2 * t.items.size() + 1024;
@@ -304,27 +321,24 @@ int SandboxState::iterateItems(uid_t uid, const std::function<void(const Sandbox
         if (int rc = refresh(path, t)) return rc;
         items.reserve(t.items.size());
         for (const auto& [key, itemPath] : t.items)
-            items.push_back({std::get<0>(key), std::get<1>(key), std::get<2>(key), itemPath});
+            items.push_back({std::get<0>(key), std::get<1>(key), std::get<2>(key), hostPath(itemPath)});
     }
     for (const auto& item : items) callback(item);
     return 0;
 }
 
 int SandboxState::clearForBoot() {
-    std::string dir = directory();
     std::lock_guard<std::mutex> lock(gMutex);
     gTables.clear();
-    int fd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
-    if (fd < 0) return errno == ENOENT ? 0 : errno;
-    std::vector<DirectoryEntry> entries;
-    int rc = readDirectoryEntries(fd, &entries);
-    ::close(fd);
-    if (rc) return rc;
-    for (const auto& e : entries) {
-        int err = durable::removeFile(joinPath(dir, e.name));
-        if (err != 0 && err != ENOENT && rc == 0) rc = err;
-    }
-    return rc;
+    return removeEntries([](const std::string&) { return true; });
+}
+
+int SandboxState::removeTemporaryFiles() {
+    std::lock_guard<std::mutex> lock(gMutex);
+    // The atomic writer's temporaries: ".uid-N.tmp-UUID" beside "uid-N".
+    return removeEntries([](const std::string& name) {
+        return name.rfind(".uid-", 0) == 0 && name.find(".tmp-") != std::string::npos;
+    });
 }
 
 }  // namespace vsl

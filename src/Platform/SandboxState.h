@@ -8,7 +8,9 @@
 // A table is an append-only log of checksummed records replayed into memory: a set
 // is one appended record, and a record torn by a crash is dropped on the next read.
 // The process keeps each table in memory and re-reads it when its file changed.
-// Functions return 0 or an errno value; any thread may call them.
+// Paths below the system root are stored relative to it, so a root that was copied
+// or moved answers with its own paths. Functions return 0 or an errno value; any
+// thread may call them.
 #pragma once
 
 #include <sys/types.h>
@@ -48,6 +50,10 @@ public:
 
     // Forgets every uid's items: what a boot does to kernel memory.
     static int clearForBoot();
+
+    // Removes the temporary files of table rewrites that a kill cut short. For the
+    // start, before anything writes a table.
+    static int removeTemporaryFiles();
 
     static std::string directory();  // run/vesseld/sandbox below the system root
 };

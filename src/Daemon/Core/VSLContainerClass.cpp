@@ -1,68 +1,142 @@
 #include "Daemon/Core/VSLContainerClass.h"
 
+#include <unistd.h>
+
 #include <cstring>
+#include <mutex>
+
+#include "Platform/DeviceFacts.h"
+#include "Platform/Log.h"
 
 namespace vsl {
 
 namespace {
 
-struct ClassRow {
-    const char* directory;
-    const char* shortName;
-};
+// Skeletons: keep in step with docs/containers.md.
+constexpr const char* kDataSkeleton[] = {"Documents",           "Library",    "Library/Caches",
+                                         "Library/Preferences", "SystemData", "tmp"};
+constexpr const char* kGroupSkeleton[] = {"Library", "Library/Caches", "Library/Preferences"};
+constexpr const char* kTempDirSkeleton[] = {"tmp"};
+constexpr const char* kSystemDataSkeleton[] = {"Library", "Library/Caches", "Library/Preferences", "tmp"};
+constexpr const char* kSystemGroupSkeleton[] = {"Library", "Library/Caches", "Library/Preferences"};
+constexpr std::span<const char* const> kNoSkeleton;  // bundles: the installer fills them
 
-constexpr ClassRow kClasses[] = {
-    {"Undefined", nullptr},
-    {"Bundle/Application", "app"},
-    {"Data/Application", "appData"},
-    {"Bundle/PluginKitPlugin", "plugin"},
-    {"Data/PluginKitPlugin", "pluginData"},
-    {"Bundle/VPNPlugin", "vpn"},
-    {"Data/VPNPlugin", "vpnData"},
-    {"Shared/AppGroup", "appGroup"},
-    {"Bundle/Framework", "framework"},
-    {"Data/IPCService", "ipcService"},
-    {"Data/InternalDaemon", "daemon"},
-    {"Data/TempDir", "tempDir"},
-    {"Data/System", "systemData"},
-    {"Shared/SystemGroup", "systemGroup"},
-    {"MAX", nullptr},
+constexpr const char* kContainerExtension = "com.tarrow.sandbox.container";
+constexpr const char* kGroupExtension = "com.tarrow.sandbox.application-group";
+
+using F = VSLContainerFamily;
+using O = VSLContainerOwner;
+using P = VSLSkeletonProtection;
+
+constexpr VSLContainerClassTraits bound(const char* name) {
+    return {name, nullptr, F::Invalid, false, false, true, O::None, O::None, 0, kNoSkeleton, P::None, 0, nullptr};
+}
+constexpr VSLContainerClassTraits bundle(const char* name, const char* shortName) {
+    return {name, shortName, F::Bundle, false, false, false, O::Installer, O::Installer, 0755, kNoSkeleton, P::None,
+            0,    nullptr};
+}
+constexpr VSLContainerClassTraits data(const char* name, const char* shortName, bool childData,
+                                       std::span<const char* const> skeleton, const char* extension) {
+    return {name, shortName, F::Data, false, childData, true, O::User, O::User, 0755, skeleton, P::Container,
+            1,    extension};
+}
+
+constexpr VSLContainerClassTraits kClasses[] = {
+    bound("Undefined"),
+    bundle("Bundle/Application", "app"),
+    data("Data/Application", "appData", false, kDataSkeleton, kContainerExtension),
+    bundle("Bundle/PluginKitPlugin", "plugin"),
+    data("Data/PluginKitPlugin", "pluginData", true, kDataSkeleton, kContainerExtension),
+    bundle("Bundle/VPNPlugin", "vpn"),
+    data("Data/VPNPlugin", "vpnData", true, kDataSkeleton, kContainerExtension),
+    {"Shared/AppGroup", "appGroup", F::Group, true, false, true, O::User, O::User, 0755, kGroupSkeleton, P::Container,
+     2, kGroupExtension},
+    bundle("Bundle/Framework", "framework"),
+    data("Data/IPCService", "ipcService", false, kDataSkeleton, nullptr),
+    data("Data/InternalDaemon", "daemon", false, kDataSkeleton, kContainerExtension),
+    data("Data/TempDir", "tempDir", false, kTempDirSkeleton, nullptr),
+    {"Data/System", "systemData", F::System, false, false, false, O::SystemContainer, O::Nobody, 0,
+     kSystemDataSkeleton, P::None, 4, nullptr},
+    {"Shared/SystemGroup", "systemGroup", F::System, true, false, false, O::SystemContainer, O::Nobody, 0,
+     kSystemGroupSkeleton, P::None, 8, nullptr},
+    bound("MAX"),
 };
+static_assert(std::size(kClasses) == kVSLClassMax + 1);
+
+constexpr VSLContainerClassTraits kPastBounds = bound(nullptr);
+
+constexpr uid_t kNobodyID = 4294967294u;  // the 32-bit pattern of -2
 
 }  // namespace
 
-bool isValidContainerClass(VSLContainerClass c) { return c >= 1 && c <= 13; }
+const VSLContainerClassTraits& containerClassTraits(VSLContainerClass c) {
+    return c < std::size(kClasses) ? kClasses[c] : kPastBounds;
+}
 
-bool isBundleContainerClass(VSLContainerClass c) { return c == 1 || c == 3 || c == 5 || c == 8; }
+bool isValidContainerClass(VSLContainerClass c) { return containerClassTraits(c).family != F::Invalid; }
 
-bool isSystemContainerClass(VSLContainerClass c) { return c == 12 || c == 13; }
+bool isBundleContainerClass(VSLContainerClass c) { return containerClassTraits(c).family == F::Bundle; }
+
+bool isSystemContainerClass(VSLContainerClass c) { return containerClassTraits(c).family == F::System; }
 
 bool isPerUserContainerClass(VSLContainerClass c) {
-    return isValidContainerClass(c) && !isBundleContainerClass(c) && !isSystemContainerClass(c);
+    F family = containerClassTraits(c).family;
+    return family == F::Data || family == F::Group;
 }
 
-bool isGroupContainerClass(VSLContainerClass c) { return c == 7 || c == 13; }
+bool isGroupContainerClass(VSLContainerClass c) { return containerClassTraits(c).group; }
 
-bool isChildDataContainerClass(VSLContainerClass c) { return c == 4 || c == 6; }
+bool isChildDataContainerClass(VSLContainerClass c) { return containerClassTraits(c).childData; }
 
-const char* containerClassDirectoryName(VSLContainerClass c) {
-    return c < std::size(kClasses) ? kClasses[c].directory : nullptr;
-}
+const char* containerClassDirectoryName(VSLContainerClass c) { return containerClassTraits(c).directoryName; }
 
-const char* containerClassShortName(VSLContainerClass c) {
-    return c < std::size(kClasses) ? kClasses[c].shortName : nullptr;
-}
+const char* containerClassShortName(VSLContainerClass c) { return containerClassTraits(c).shortName; }
 
 VSLContainerClass containerClassForShortName(const char* name) {
     if (!name) return kVSLClassUndefined;
-    for (VSLContainerClass c = 1; c <= 13; c++)
+    for (VSLContainerClass c = 1; c < kVSLClassMax; c++)
         if (std::strcmp(kClasses[c].shortName, name) == 0) return c;
     return kVSLClassUndefined;
 }
 
+namespace {
+
+uint32_t ownerID(VSLContainerOwner owner, uint32_t userID) {
+    switch (owner) {
+        case O::Installer: return deviceFacts().installerUID;
+        case O::SystemContainer: return deviceFacts().systemContainerUID;
+        case O::Nobody: return kNobodyID;
+        case O::User:
+        case O::None: break;
+    }
+    return userID;
+}
+
+}  // namespace
+
+uint32_t containerOwnerIDForClass(VSLContainerClass c, uint32_t userID) {
+    return ownerID(containerClassTraits(c).owner, userID);
+}
+
+VSLSkeletonOwnership skeletonOwnershipForClass(VSLContainerClass c, uid_t userUID) {
+    const auto& traits = containerClassTraits(c);
+    VSLSkeletonOwnership result{ownerID(traits.skeletonOwner, userUID), traits.skeletonMode};
+    const uid_t self = ::geteuid();
+    if (traits.skeletonOwner != O::Nobody || self == 0) return result;
+    static std::once_flag logged;
+    std::call_once(logged, [&] {
+        LogWrite(kLogLevelNotice, "skeletonOwnershipForClass",
+                 "Running without root: system container subdirectories are owned by uid %u (mode 0700) instead of "
+                 "uid %u (mode 0)",
+                 self, result.owner);
+    });
+    return {self, 0700};
+}
+
 void forEachPerUserContainerClass(const std::function<void(VSLContainerClass)>& work) {
     // Each call's locals are gone when it returns: the pool boundary is the call itself.
-    for (VSLContainerClass c : {2, 4, 6, 7, 9, 10, 11}) work(c);
+    for (VSLContainerClass c = 1; c < kVSLClassMax; c++)
+        if (isPerUserContainerClass(c)) work(c);
 }
 
 }  // namespace vsl

@@ -2,7 +2,6 @@
 
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Daemon/Storage/VSLFileManager.h"
-#include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
 
 namespace vsl {
@@ -128,20 +127,16 @@ Value VSLUserIdentity::plist() const {
 }
 
 uid_t VSLUserIdentity::posixUIDForContainerClass(VSLContainerClass c) const {
-    if (isBundleContainerClass(c)) return deviceFacts().installerUID;
-    if (isSystemContainerClass(c)) return deviceFacts().systemContainerUID;
-    return uid_;
+    return containerOwnerIDForClass(c, uid_);
 }
 
 gid_t VSLUserIdentity::posixGIDForContainerClass(VSLContainerClass c) const {
     // The platform's installer and system uids serve as gids too.
-    if (isBundleContainerClass(c)) return deviceFacts().installerUID;
-    if (isSystemContainerClass(c)) return deviceFacts().systemContainerUID;
-    return gid_;
+    return containerOwnerIDForClass(c, gid_);
 }
 
 bool VSLUserIdentity::isUserIdentityRequiredForContainerClass(VSLContainerClass c) {
-    return !isBundleContainerClass(c) && !isSystemContainerClass(c);
+    return containerClassTraits(c).userIdentityRequired;
 }
 
 const char* VSLUserIdentity::descriptionForPersonaType(uint32_t type) {

@@ -25,8 +25,6 @@ namespace {
 
 const char* const kCreateFn =
     "-[VSLClientConnection createOrLookupContainerWithContainerIdentity:createIfNecessary:transient:useLocking:withError:]";
-constexpr uid_t kSystemSubdirectoryOwner = 4294967294u;  // the 32-bit pattern of -2
-constexpr uid_t kBundleOwner = 33;
 
 bool isNotFound(const VSLErrorRef& e) { return errorHasCode(e, kVSLErrorNotFound); }
 
@@ -41,14 +39,13 @@ VSLMetadataRef foundRecord(const VSLMetadataRef& cached) {
 
 bool VSLClientConnection::_createTopLevelContainerDirectory(const std::string& url, VSLContainerClass containerClass,
                                                             uid_t owner, VSLErrorRef* error) {
-    uid_t uid = isBundleContainerClass(containerClass) ? kBundleOwner
-                : isSystemContainerClass(containerClass) ? 0
-                                                          : owner;
-    return VSLFileManager::defaultManager().createDirectoryAtURL(url, true, 0755, uid, static_cast<VSLDataProtectionClass>(0), error);
+    return VSLFileManager::defaultManager().createDirectoryAtURL(
+        url, true, 0755, containerOwnerIDForClass(containerClass, owner), static_cast<VSLDataProtectionClass>(0), error);
 }
 
 int32_t VSLClientConnection::_dataProtectionClassForContainerMetadata(const VSLMetadata& metadata) {
-    if (!isPerUserContainerClass(metadata.containerClass())) return 0;
+    if (containerClassTraits(metadata.containerClass()).skeletonProtection != VSLSkeletonProtection::Container)
+        return 0;
     if (metadata.info()) {
         const Value* v = metadata.info()->find("com.tarrow.Stowage.ContentProtectionClass");
         if (v && v->signedNumber()) return static_cast<int32_t>(*v->signedNumber());
@@ -61,10 +58,8 @@ int32_t VSLClientConnection::_dataProtectionClassForContainerMetadata(const VSLM
 bool VSLClientConnection::_createSubDirectories(const std::string& url, const VSLMetadata& metadata,
                                                 VSLErrorRef* error) {
     VSLContainerClass c = metadata.containerClass();
-    mode_t mode = isSystemContainerClass(c) ? 0 : 0755;
-    uid_t owner = isBundleContainerClass(c)   ? kBundleOwner
-                  : isSystemContainerClass(c) ? kSystemSubdirectoryOwner
-                                              : metadata.userIdentity()->posixUIDForContainerClass(c);
+    const auto& user = metadata.userIdentity();
+    const auto [owner, mode] = skeletonOwnershipForClass(c, user ? user->posixUIDForContainerClass(c) : 0);
     uint64_t listCode = 1;
     auto names = subdirectoriesForContainerClass(c, &listCode);
     if (!names) {
@@ -301,9 +296,7 @@ void issueSandboxExtension(VSLReply& reply, const char* replyKey, const VSLMetad
                            const VSLClientIdentityRef& client) {
     if (!client || !client->sandboxed()) return;
     VSLContainerClass c = metadata.containerClass();
-    const char* extensionClass = nullptr;
-    if (c == 2 || c == 4 || c == 6 || c == 10) extensionClass = "com.tarrow.sandbox.container";
-    if (c == 7) extensionClass = "com.tarrow.sandbox.application-group";
+    const char* extensionClass = containerClassTraits(c).sandboxExtensionClass;
     bool enterprise = metadata.userIdentity() && metadata.userIdentity()->isEnterprise();
     if (!enterprise || !extensionClass) {
         osLog(LogCategory::Sandbox, OSLogLevel::Info,

@@ -11,6 +11,7 @@
 #include "Platform/CrashAnnotation.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
+#include "Platform/SandboxState.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {
@@ -48,6 +49,10 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
         if (!mapping->removeAllAdvanceCopiesWithError(&error))
             LogWrite(kLogLevelError, "vesseld_init", "Failed to remove advance copies: %@", error);
     }
+
+    // Before any table is written: a kill during a rewrite leaves its temporary file.
+    if (int rc = SandboxState::removeTemporaryFiles())
+        LogWrite(kLogLevelError, "vesseld_init", "Failed to remove temporary sandbox files: %d", rc);
 
     // Every start: whatever a crash left on death row is destroyed in the background.
     VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);

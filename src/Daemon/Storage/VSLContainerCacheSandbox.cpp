@@ -15,16 +15,13 @@ struct SandboxTarget {
     uid_t uid;
 };
 
-// Bundle classes keep no item; classes outside 1..13 have none either.
+// Bundle classes keep no item; classes outside 1..13 have none either. System items
+// are filed under uid 0, per-user ones under the user's.
 std::optional<SandboxTarget> sandboxTarget(const VSLUserIdentityRef& userIdentity, VSLContainerClass containerClass) {
-    auto uid = [&] { return userIdentity ? userIdentity->posixUIDForContainerClass(containerClass) : uid_t(0); };
-    switch (containerClass) {
-    case 2: case 4: case 6: case 9: case 10: case 11: return SandboxTarget{1, uid()};
-    case 7: return SandboxTarget{2, uid()};
-    case 12: return SandboxTarget{4, 0};
-    case 13: return SandboxTarget{8, 0};
-    default: return std::nullopt;
-    }
+    const auto& traits = containerClassTraits(containerClass);
+    if (traits.sandboxItemType == 0) return std::nullopt;
+    if (traits.owner != VSLContainerOwner::User || !userIdentity) return SandboxTarget{traits.sandboxItemType, 0};
+    return SandboxTarget{traits.sandboxItemType, userIdentity->posixUIDForContainerClass(containerClass)};
 }
 
 int32_t personaIDOf(const VSLUserIdentityRef& userIdentity) {
@@ -100,8 +97,8 @@ bool VSLContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const VSLUs
     bool multi = false;
     std::optional<std::string> parent;
     const bool enterprise = userIdentity && userIdentity->isEnterprise();
-    switch (containerClass) {
-    case 2: case 4: case 6: case 9: case 10: case 11: {
+    switch (containerClassTraits(containerClass).family) {
+    case VSLContainerFamily::Data: {
         if (isChildDataContainerClass(containerClass) && codeSigningMapping_)
             parent = codeSigningMapping_->parentIdentifierForChildIdentifier(identifier);
         const std::string& bundleIdentifier = parent ? *parent : identifier;
@@ -114,7 +111,7 @@ bool VSLContainerCache::shouldRegisterSandboxMappingWithUserIdentity(const VSLUs
         decision = multi ? !enterprise : identities.count(userIdentity) > 0;
         break;
     }
-    case 7: decision = true; break;
+    case VSLContainerFamily::Group: decision = true; break;
     default: decision = !enterprise; break;
     }
     osLog(LogCategory::Sandbox, OSLogLevel::Info,
@@ -141,7 +138,7 @@ VSLMetadataRef VSLContainerCache::_lock_metadataFromSandboxForContainerIdentity(
             osLog(LogCategory::Sandbox, OSLogLevel::Debug, "Skipping sandbox item without identifier or path");
             return;
         }
-        if (containerClass == 7 && item.personaID != personaIDOf(userIdentity)) return;
+        if (containerClassTraits(containerClass).family == VSLContainerFamily::Group && item.personaID != personaIDOf(userIdentity)) return;
         if (std::strncmp(item.identifier.c_str(), identity.identifier().c_str(), kKernelItemIdentifierLimit) == 0)
             candidate = item.path;
     });

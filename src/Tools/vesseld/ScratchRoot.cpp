@@ -10,6 +10,7 @@
 
 #include "Daemon/Core/VSLPropertyListFile.h"
 #include "Platform/DeviceFacts.h"
+#include "Platform/DurableIO.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {
@@ -20,8 +21,11 @@ bool makeDirs(const std::string& path, std::string* error) {
     for (size_t i = 1; i <= path.size(); i++) {
         if (i != path.size() && path[i] != '/') continue;
         std::string part = path.substr(0, i);
-        if (::mkdir(part.c_str(), 0755) != 0 && errno != EEXIST) {
-            *error = "mkdir " + part + ": " + std::strerror(errno);
+        struct stat st;
+        if (::lstat(part.c_str(), &st) == 0) continue;
+        int rc = durable::makeDirectory(part, 0755);
+        if (rc != 0 && rc != EEXIST) {
+            *error = "mkdir " + part + ": " + std::strerror(rc);
             return false;
         }
     }
@@ -32,13 +36,10 @@ bool writeIfMissing(const std::string& relative, const std::string& contents, st
     std::string path = rootedPath(relative);
     if (::access(path.c_str(), F_OK) == 0) return true;
     if (!makeDirs(parentPath(path), error)) return false;
-    FILE* f = std::fopen(path.c_str(), "wx");
-    if (!f) {
-        *error = "create " + path + ": " + std::strerror(errno);
+    if (int rc = durable::writeFileAtomically(path, contents.data(), contents.size(), 0644)) {
+        *error = "create " + path + ": " + std::strerror(rc);
         return false;
     }
-    std::fwrite(contents.data(), 1, contents.size(), f);
-    std::fclose(f);
     return true;
 }
 
@@ -51,7 +52,10 @@ bool plistIfMissing(const std::string& relative, const Value& dictionary, std::s
         *error = "write " + path + ": " + (e ? e->description() : "");
         return false;
     }
-    ::chmod(path.c_str(), 0644);
+    if (int rc = durable::changeMode(path, 0644)) {
+        *error = "chmod " + path + ": " + std::strerror(rc);
+        return false;
+    }
     return true;
 }
 
@@ -74,8 +78,8 @@ bool initializeScratchRoot(std::string* error) {
     bool asRoot = ::geteuid() == 0;
     uid_t uid = asRoot ? 501 : ::geteuid();
     gid_t gid = asRoot ? 501 : ::getegid();
-    uid_t installer = asRoot ? 33 : ::geteuid();
-    uid_t system = asRoot ? 0 : ::geteuid();
+    uid_t installer = defaultInstallerUID();
+    uid_t system = defaultSystemContainerUID();
     gid_t systemUsers = asRoot ? 95 : ::getegid();
     std::string u = std::to_string(uid), g = std::to_string(gid);
 
