@@ -77,8 +77,27 @@ public:
                                               uint64_t* code);
     bool _createTopLevelContainerDirectory(const std::string& url, VSLContainerClass containerClass, uid_t owner,
                                            VSLErrorRef* error);
-    bool _createSubDirectories(const std::string& url, const VSLMetadata& metadata, VSLErrorRef* error);
+    // With `onlyMissing`, an entry that exists (whatever it is) is left as it is.
+    bool _createSubDirectories(const std::string& url, const VSLMetadata& metadata, VSLErrorRef* error,
+                               bool onlyMissing = false);
     int32_t _dataProtectionClassForContainerMetadata(const VSLMetadata& metadata);
+
+    // Info values, metadata, skeleton, directory name and disk usage of one existing
+    // container (VSLClientConnectionInfo.cpp). Reads take its identifier read lock,
+    // writes its write lock; the renaming takes the global write lock.
+    bool setInfoValue(const std::optional<Value>& value, const Value& key,
+                      const VSLConcreteContainerIdentityRef& identity, bool useLocking, uint64_t* code);
+    std::optional<Value> infoValueForKey(const Value& key, const VSLConcreteContainerIdentityRef& identity,
+                                         bool useLocking, uint64_t* code);
+    VSLMetadataRef metadataWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity, uint64_t* code);
+    bool recreateDefaultStructureWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity,
+                                                       uint64_t* code);
+    bool regenerateDirectoryUUIDWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity,
+                                                      uint64_t* code);
+    std::optional<uint64_t> diskUsageWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity,
+                                                           uint64_t* code);
+    // Exits the process while crashes remain (VSLRetryTest.cpp).
+    bool retryTestWithNumCrashes(uint64_t numCrashes, uint64_t* code);
 
     // Death row. Destruction runs later on the death-row queue inside a keep-alive
     // transaction; the completion gets 1, or the code of the last failure.
@@ -92,6 +111,8 @@ private:
     VSLClientConnection() = default;
     bool mayAccess(const VSLContainerIdentity& identity, uint64_t* code);
     VSLMetadataRef createContainer(const VSLContainerIdentityRef& identity, bool transient, VSLErrorRef* error);
+    bool _lock_setInfoValue(const std::optional<Value>& value, const std::string& key,
+                            const VSLConcreteContainerIdentityRef& identity, VSLErrorRef* error);
 
     VSLClientIdentityRef clientIdentity_;
     std::shared_ptr<VSLCommandQueue> commandQueue_;

@@ -1,10 +1,12 @@
 // Create, look up, list and delete containers on behalf of one client.
 #include <cerrno>
+#include <cstring>
 
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/CodeSigning/VSLWhitelist.h"
 #include "Daemon/Concurrency/VSLCommandStageForDelete.h"
 #include "Daemon/Concurrency/VSLLocks.h"
+#include "Daemon/Concurrency/VSLTestLocks.h"
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Daemon/Core/VSLExceptionGuard.h"
 #include "Daemon/Service/VSLClientConnection.h"
@@ -16,8 +18,10 @@
 #include "Daemon/Storage/VSLFileManager.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
 #include "Platform/DeviceFacts.h"
+#include "Platform/DurableIO.h"
 #include "Platform/SandboxExtension.h"
 #include "Platform/SystemRoot.h"
+#include "Platform/UniqueFd.h"
 
 namespace vsl {
 
@@ -33,6 +37,14 @@ VSLMetadataRef foundRecord(const VSLMetadataRef& cached) {
     auto copy = cached->mutableCopy();
     copy->setExisted(true);
     return copy;
+}
+
+// ENOENT for a missing skeleton entry, 0 for one that exists as anything (a link or
+// a file included: left alone, never followed), else the failure.
+int skeletonEntryState(const std::string& dir) {
+    UniqueFd fd;
+    int rc = durable::openDirectoryNoFollow(dir, fd.out());
+    return rc == ELOOP || rc == ENOTDIR ? 0 : rc;
 }
 
 }  // namespace
@@ -56,7 +68,7 @@ int32_t VSLClientConnection::_dataProtectionClassForContainerMetadata(const VSLM
 }
 
 bool VSLClientConnection::_createSubDirectories(const std::string& url, const VSLMetadata& metadata,
-                                                VSLErrorRef* error) {
+                                                VSLErrorRef* error, bool onlyMissing) {
     VSLContainerClass c = metadata.containerClass();
     const auto& user = metadata.userIdentity();
     const auto [owner, mode] = skeletonOwnershipForClass(c, user ? user->posixUIDForContainerClass(c) : 0);
@@ -73,6 +85,14 @@ bool VSLClientConnection::_createSubDirectories(const std::string& url, const VS
     auto excluded = VSLGlobalConfiguration::excludedFromAppUserData();
     for (const auto& name : *names) {
         std::string dir = joinPath(url, name);
+        if (onlyMissing) {
+            int rc = skeletonEntryState(dir);
+            if (rc != ENOENT && rc != 0) {
+                if (error) *error = VSL_POSIX_ERROR(rc, "Failed to open %@: %s", dir, std::strerror(rc));
+                return false;
+            }
+            if (rc == 0) continue;
+        }
         int32_t cls = protection;
         if (isPerUserContainerClass(c) && std::find(excluded.begin(), excluded.end(), name) != excluded.end()) cls = 0;
         VSLErrorRef underlying;
@@ -243,6 +263,7 @@ VSLMetadataRef VSLClientConnection::createContainer(const VSLContainerIdentityRe
     if (!classDirectory) return cleanUp(VSL_ERROR(kVSLErrorUnexpectedClass, nullptr, true,
                                                   "Passed an unexpected container type: %llu", c));
     std::string live = joinPath(*classDirectory, wellKnown.value_or(directoryName));
+    VSLTestLocks::sharedInstance().waitOnLock(VSLTestLocks::kCreateGate);
     if (!fm.moveItemAtURL(staging, live, &underlying))
         return cleanUp(VSL_ERROR(kVSLErrorMoveStagingDir, underlying, true,
                                  "Failed to move staging dir: %@ to live dir: %@", staging, live));

@@ -8,6 +8,7 @@
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Storage/VSLFileManager.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
+#include "Daemon/Concurrency/VSLTestLocks.h"
 #include "Platform/DurableIO.h"
 #include "Platform/SystemRoot.h"
 
@@ -88,6 +89,7 @@ void VSLClientConnection::deleteContainersOnDeathRowWithCompletion(std::function
                                           "Failed to get items for deletion: %@ : %@", deathRow, listError);
         } else {
             for (const auto& item : *items) {
+                VSLTestLocks::sharedInstance().waitOnLock(VSLTestLocks::kDeathRowGate);
                 VSLErrorRef itemError;
                 if (!self->_removeItemOrMoveToTempAtURL(item.path, &itemError))
                     recorded = createVSLError(writer, __LINE__, kVSLErrorDestroyDeathRowItem, itemError, true,

@@ -5,6 +5,7 @@
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Daemon/Service/VSLContainerHandlers.h"
 #include "Daemon/Service/VSLEntitlements.h"
+#include "Daemon/Service/VSLInfoHandlers.h"
 #include "Daemon/Service/VSLRequestDecoding.h"
 #include "Platform/Log.h"
 
@@ -24,11 +25,11 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {2, nullptr, A, 0x1},
     {3, handleStageContainerForDelete, A, 0x1},
     {4, handleDeleteContainersOnDeathRow, kVSLEntitlementUserManagedAssets, 0x0},
-    {5, nullptr, A, 0x1},
-    {6, nullptr, A, 0x1},
-    {7, nullptr, A, 0x1},
-    {8, nullptr, A, 0x1},
-    {9, nullptr, A, 0x1},
+    {5, handleSetInfoValue, A, 0x1},
+    {6, handleInfoValueForKey, A, 0x1},
+    {7, handleMetadata, A, 0x1},
+    {8, handleRecreateDefaultStructure, A, 0x1},
+    {9, handleRegenerateDirectoryUUID, A, 0x1},
     {10, handleDeleteContainer, A, 0x1},
     {11, nullptr, kVSLEntitlementWipeContainer, 0x1},
     {12, nullptr, kVSLEntitlementDeleteContainerContent, 0x1},
@@ -41,16 +42,16 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {19, getCodeSigningInfoCommand, A, 0x1},
     {20, invalidateCodeSigningInfoCommand, A, 0x1},
     {21, nullptr, A, 0x0},
-    {22, nullptr, A, 0x1},
-    {23, nullptr, A, 0x10001},
+    {22, handleRecreateDefaultStructure, A, 0x1},
+    {23, handleDiskUsage, A, 0x10001},
     {24, nullptr, kVSLEntitlementDataMigration, 0x1},
-    {25, nullptr, kVSLEntitlementTestability, 0x1},
+    {25, handleRetryTest, kVSLEntitlementTestability, 0x1},
     {26, nullptr, kVSLEntitlementStageSharedContent, 0x1},
     {27, retiredCommand, A, 0x1},
     {28, nullptr, kVSLEntitlementUserManagedAssets, 0x101},
     {29, nullptr, kVSLEntitlementUserManagedAssets, 0x1},
     {30, nullptr, kVSLEntitlementDataMigration, 0x1},
-    {31, nullptr, kVSLEntitlementTestability, 0x1},
+    {31, handleSetTestLock, kVSLEntitlementTestability, 0x1},
     {32, listAccessiblePersonas, A, 0x10101},
 };
 

@@ -9,6 +9,7 @@
 #include "Client/VSLConnection.h"
 #include "Client/VSLProtocol.h"
 #include "Platform/PropertyList.h"
+#include "Subcommands.h"
 
 using namespace vsl;
 using namespace vsl::client;
@@ -28,6 +29,7 @@ int usage(FILE* out) {
                  "\n"
                  "commands:\n");
     for (uint64_t i = 0; i < kVSLProtocolCommandCount; i++) std::fprintf(out, "  %2llu  %s\n", (unsigned long long)i, commandName(i));
+    std::fprintf(out, "\nsubcommands:\n%s", kSubcommandUsage);
     return out == stdout ? 0 : 2;
 }
 
@@ -63,8 +65,14 @@ int main(int argc, char** argv) {
     }
     if (i >= argc) return usage(stderr);
 
-    std::string name = argv[i++];
-    std::optional<uint64_t> number = commandNumberForName(name.c_str());
+    std::string subcommandError;
+    std::optional<Dictionary> subcommand = subcommandRequest(argc, argv, &i, &subcommandError);
+    if (!subcommandError.empty()) {
+        std::fprintf(stderr, "vesselctl: %s\n", subcommandError.c_str());
+        return 2;
+    }
+    std::string name = subcommand ? std::string() : argv[i++];
+    std::optional<uint64_t> number = subcommand ? std::optional<uint64_t>(0) : commandNumberForName(name.c_str());
     if (!number) {
         char* end = nullptr;
         unsigned long long n = std::strtoull(name.c_str(), &end, 10);
@@ -74,7 +82,7 @@ int main(int argc, char** argv) {
         }
         number = n;
     }
-    Dictionary request{{"Command", Value::uint64(*number)}};
+    Dictionary request = subcommand ? *subcommand : Dictionary{{"Command", Value::uint64(*number)}};
     for (; i < argc; i++) {
         std::string error;
         auto kv = parseArgument(argv[i], &error);

@@ -1,0 +1,85 @@
+#include "Subcommands.h"
+
+#include <cstdlib>
+#include <cstring>
+
+
+using namespace vsl;
+
+const char* const kSubcommandUsage =
+    "  info get KEY | info set KEY [Value[:type]=V]   (with Identifier= ContainerClass= UUID=)\n"
+    "  metadata | recreate-structure | regenerate-uuid | du   (with the same keys)\n"
+    "  test-lock N on|off | retry-test N\n";
+
+namespace {
+
+std::optional<uint64_t> number(const char* text) {
+    char* end = nullptr;
+    unsigned long long n = std::strtoull(text, &end, 10);
+    if (!*text || *end) return std::nullopt;
+    return n;
+}
+
+Dictionary command(uint64_t number) { return {{"Command", Value::uint64(number)}}; }
+
+}  // namespace
+
+std::optional<Dictionary> subcommandRequest(int argc, char** argv, int* index, std::string* error) {
+    const int i = *index;
+    const std::string word = argv[i];
+    auto need = [&](int words, const char* usage) {
+        if (i + words < argc) return true;
+        *error = std::string("usage: vesselctl ") + usage;
+        return false;
+    };
+    Dictionary request;
+    if (word == "info") {
+        if (!need(2, "info get|set KEY ...")) return Dictionary{};
+        std::string verb = argv[i + 1];
+        if (verb != "get" && verb != "set") {
+            *error = "usage: vesselctl info get|set KEY ...";
+            return Dictionary{};
+        }
+        request = command(verb == "get" ? 6 : 5);
+        request["Key"] = Value::string(argv[i + 2]);
+        *index = i + 3;
+        return request;
+    }
+    if (word == "metadata") {
+        request = command(7);
+        request["InfoDictRequested"] = Value::boolean(true);
+    } else if (word == "recreate-structure") {
+        request = command(8);
+    } else if (word == "regenerate-uuid") {
+        request = command(9);
+    } else if (word == "du") {
+        request = command(23);
+    } else if (word == "test-lock") {
+        if (!need(2, "test-lock N on|off")) return Dictionary{};
+        auto lock = number(argv[i + 1]);
+        std::string state = argv[i + 2];
+        if (!lock || (state != "on" && state != "off")) {
+            *error = "usage: vesselctl test-lock N on|off";
+            return Dictionary{};
+        }
+        request = command(31);
+        request["TestLock"] = Value::uint64(*lock);
+        request["Enable"] = Value::boolean(state == "on");
+        *index = i + 3;
+        return request;
+    } else if (word == "retry-test") {
+        auto crashes = i + 1 < argc ? number(argv[i + 1]) : std::nullopt;
+        if (!crashes) {
+            *error = "usage: vesselctl retry-test N";
+            return Dictionary{};
+        }
+        request = command(25);
+        request["NumRetryCrashes"] = Value::uint64(*crashes);
+        *index = i + 2;
+        return request;
+    } else {
+        return std::nullopt;
+    }
+    *index = i + 1;
+    return request;
+}
