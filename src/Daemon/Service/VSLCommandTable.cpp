@@ -5,6 +5,7 @@
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Daemon/Service/VSLContainerHandlers.h"
 #include "Daemon/Service/VSLEntitlements.h"
+#include "Daemon/Service/VSLReplaceHandler.h"
 #include "Daemon/Service/VSLRequestDecoding.h"
 #include "Platform/Log.h"
 
@@ -21,7 +22,7 @@ constexpr const char* A = kVSLEntitlementAllowed;
 const VSLCommandRow kCommands[kVSLCommandCount] = {
     {0, handleCreateOrLookup, A, 0x10101},
     {1, handleContainersWithClass, A, 0x10001},
-    {2, nullptr, A, 0x1},
+    {2, handleReplaceContainer, A, 0x1},
     {3, handleStageContainerForDelete, A, 0x1},
     {4, handleDeleteContainersOnDeathRow, kVSLEntitlementUserManagedAssets, 0x0},
     {5, nullptr, A, 0x1},
