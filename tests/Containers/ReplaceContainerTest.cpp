@@ -164,11 +164,14 @@ TEST_F(ReplaceContainer, RefusedReplacementsChangeNothing) {
 
     auto r = daemon.run(admin, replaceArgs(old, 2, old, 2));
     EXPECT_EQ(22u, r.code()) << "a container in its own place";
-    r = daemon.run(admin, {"--json", "replace", std::string("OldIdentifier=") + kApp, "OldContainerClass=2",
-                           "OldContainerUUID=" + old.uuid.string(), "NewIdentifier=com.example.app.widget",
-                           "NewContainerClass=4", "NewContainerUUID=" + other.uuid.string()});
-    EXPECT_EQ(1, r.exitCode);
-    EXPECT_NE(std::string::npos, r.out.find("\"ReplyError\":23")) << r.out;
+    std::string json, jsonErr;
+    int status = runProgram({admin, "--root", daemon.root(), "--json", "replace", std::string("OldIdentifier=") + kApp,
+                             "OldContainerClass=2", "OldContainerUUID=" + old.uuid.string(),
+                             "NewIdentifier=com.example.app.widget", "NewContainerClass=4",
+                             "NewContainerUUID=" + other.uuid.string()},
+                            &json, &jsonErr);
+    EXPECT_EQ(1, status) << "another class";
+    EXPECT_NE(std::string::npos, json.find("\"ReplyError\":23")) << json << jsonErr;
     // Promotion of the transient container while the permanent one exists.
     r = daemon.run(admin, {"replace", std::string("NewIdentifier=") + kApp, "NewContainerClass=2",
                            "NewContainerUUID=" + fresh.uuid.string()});
@@ -257,6 +260,13 @@ TEST_F(ReplaceContainer, AStartSettlesEveryCrashState) {
     writeJournal(replaceDirectory() + "/" + Uuid::random().string() + ".plist", rolledBack.path,
                  classDirectory + "/" + Uuid::random().string(), parked,
                  classDirectory + "/" + Uuid::random().string());
+    // Crash after the new container arrived: rolled forward, the staged old one stays
+    // for the staging clean-up.
+    std::string forwardOld = classDirectory + "/" + Uuid::random().string();
+    std::string forwardStaging = staging + "/" + Uuid::random().string();
+    fs::create_directories(forwardStaging + "/marker");
+    writeJournal(replaceDirectory() + "/" + Uuid::random().string() + ".plist", forwardOld,
+                 classDirectory + "/" + Uuid::random().string(), forwardStaging, untouched.path);
     // Journals that cannot be trusted: garbage, a wrong type, a path climbing out.
     writeText(replaceDirectory() + "/" + Uuid::random().string() + ".plist", "not a property list");
     VSLErrorRef error;
@@ -278,6 +288,8 @@ TEST_F(ReplaceContainer, AStartSettlesEveryCrashState) {
     EXPECT_EQ(rolledBack.path, back.string("ReplyPath"));
     EXPECT_EQ("kept", readText(rolledBack.path + "/Documents/keep.txt"));
     EXPECT_FALSE(fs::exists(parked));
+    EXPECT_FALSE(fs::exists(forwardOld)) << "a finished replacement is not undone";
+    EXPECT_TRUE(fs::exists(forwardStaging + "/marker"));
     EXPECT_TRUE(fs::exists(hostileParked)) << "an untrusted journal moves nothing";
     EXPECT_FALSE(fs::exists(classDirectory + "/x"));
     EXPECT_TRUE(snapshot(replaceDirectory()).empty()) << "every journal went to death row";
