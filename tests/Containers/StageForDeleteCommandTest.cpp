@@ -28,16 +28,9 @@ void writeRootFile(const DaemonProcess& daemon, const std::string& relative, con
 }
 
 // This test program itself, entitled: vesselctl cannot send a malformed UUID.
-void registerSelf(const DaemonProcess& daemon) {
-    char exe[PATH_MAX];
-    ASSERT_TRUE(::realpath("/proc/self/exe", exe));
-    auto bytes = encodeBinaryPropertyList(dict({{"Executable", Value::string(exe)},
-                                                {"SigningIdentifier", Value::string("com.example.stager")},
-                                                {"Entitlements", dict({{kAllowed, Value::boolean(true)}})},
-                                                {"Sandboxed", Value::boolean(false)}}),
-                                          nullptr);
-    ASSERT_TRUE(bytes);
-    writeRootFile(daemon, "etc/vesseld/code-signatures/stager.plist", *bytes);
+void registerSelf(DaemonProcess& daemon) {
+    ASSERT_TRUE(daemon.registerProgram("/proc/self/exe", "stager", "com.example.stager",
+                                       dict({{kAllowed, Value::boolean(true)}})));
 }
 
 struct Made {

@@ -166,19 +166,25 @@ std::string DaemonProcess::addClient(const std::string& name, const std::string&
         out << in.rdbuf();
     }
     ::chmod(path.c_str(), 0755);
+    return registerProgram(path, name, signingIdentifier, entitlements, sandboxed) ? path : std::string();
+}
+
+bool DaemonProcess::registerProgram(const std::string& program, const std::string& name,
+                                    const std::string& signingIdentifier, const Value& entitlements,
+                                    bool sandboxed) {
     std::string dir = at("etc/vesseld/code-signatures");
     std::string mk = "mkdir -p '" + dir + "'";
-    if (std::system(mk.c_str()) != 0) return {};
+    if (std::system(mk.c_str()) != 0) return false;
     char real[PATH_MAX];
-    std::string exe = ::realpath(path.c_str(), real) ? real : path;
+    std::string exe = ::realpath(program.c_str(), real) ? real : program;
     VSLErrorRef error;
-    VSL_writeToURL(dict({{"Executable", Value::string(exe)},
-                         {"SigningIdentifier", Value::string(signingIdentifier)},
-                         {"Entitlements", entitlements},
-                         {"Sandboxed", Value::boolean(sandboxed)}}),
-                   dir + "/" + name + ".plist", kVSLWriteAtomic, &error);
+    bool written = VSL_writeToURL(dict({{"Executable", Value::string(exe)},
+                                        {"SigningIdentifier", Value::string(signingIdentifier)},
+                                        {"Entitlements", entitlements},
+                                        {"Sandboxed", Value::boolean(sandboxed)}}),
+                                  dir + "/" + name + ".plist", kVSLWriteAtomic, &error);
     ::chmod((dir + "/" + name + ".plist").c_str(), 0644);
-    return path;
+    return written;
 }
 
 uint64_t DaemonProcess::CtlResult::code() const {

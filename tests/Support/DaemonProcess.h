@@ -43,6 +43,10 @@ public:
     // signing identifier and entitlements. Returns the copy's path.
     std::string addClient(const std::string& name, const std::string& signingIdentifier, const Value& entitlements,
                           bool sandboxed = false);
+    // Registers an existing program (e.g. "/proc/self/exe": the test itself, to send
+    // requests vesselctl cannot) under `name` with that identity.
+    bool registerProgram(const std::string& program, const std::string& name, const std::string& signingIdentifier,
+                         const Value& entitlements, bool sandboxed = false);
 
     struct CtlResult {
         int exitCode = -1;

@@ -99,6 +99,16 @@ public:
     // Exits the process while crashes remain (VSLRetryTest.cpp).
     bool retryTestWithNumCrashes(uint64_t numCrashes, uint64_t* code);
 
+    // Puts the new container in the old one's place (an application update), under the
+    // global write lock and a journal, so that a crash leaves one of the two in place.
+    // An old identity without a UUID promotes the new container to its class's
+    // permanent place. `code` is written only on failure.
+    void replaceContainerIdentity(const VSLContainerIdentityRef& oldIdentity,
+                                  const VSLContainerIdentityRef& newIdentity, bool preserveOldUUID,
+                                  bool startDeletionThread, uint64_t* code);
+    // Every start: rolls back the replacements a crash left half-done, drops the rest.
+    bool _recoverFromReplaceOperationsWithError(VSLErrorRef* error);
+
     // Death row. Destruction runs later on the death-row queue inside a keep-alive
     // transaction; the completion gets 1, or the code of the last failure.
     void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);

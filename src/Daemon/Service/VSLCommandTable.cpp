@@ -6,6 +6,7 @@
 #include "Daemon/Service/VSLContainerHandlers.h"
 #include "Daemon/Service/VSLEntitlements.h"
 #include "Daemon/Service/VSLInfoHandlers.h"
+#include "Daemon/Service/VSLReplaceHandler.h"
 #include "Daemon/Service/VSLRequestDecoding.h"
 #include "Platform/Log.h"
 
@@ -22,7 +23,7 @@ constexpr const char* A = kVSLEntitlementAllowed;
 const VSLCommandRow kCommands[kVSLCommandCount] = {
     {0, handleCreateOrLookup, A, 0x10101},
     {1, handleContainersWithClass, A, 0x10001},
-    {2, nullptr, A, 0x1},
+    {2, handleReplaceContainer, A, 0x1},
     {3, handleStageContainerForDelete, A, 0x1},
     {4, handleDeleteContainersOnDeathRow, kVSLEntitlementUserManagedAssets, 0x0},
     {5, handleSetInfoValue, A, 0x1},

@@ -54,6 +54,12 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     if (int rc = SandboxState::removeTemporaryFiles())
         LogWrite(kLogLevelError, "vesseld_init", "Failed to remove temporary sandbox files: %d", rc);
 
+    // Every start: replacements a crash interrupted are settled before anything looks
+    // at containers; their journals go to death row.
+    VSLErrorRef replaceError;
+    if (!VSLClientConnection::sharedClientConnection()->_recoverFromReplaceOperationsWithError(&replaceError))
+        LogWrite(kLogLevelError, "vesseld_init", "Failed to recover replace operations: %@", replaceError);
+
     // Every start: whatever a crash left on death row is destroyed in the background.
     VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);
 

@@ -30,6 +30,12 @@ int usage(FILE* out) {
                  "commands:\n");
     for (uint64_t i = 0; i < kVSLProtocolCommandCount; i++) std::fprintf(out, "  %2llu  %s\n", (unsigned long long)i, commandName(i));
     std::fprintf(out, "\nsubcommands:\n%s", kSubcommandUsage);
+    std::fprintf(out,
+                 "\n"
+                 "replace (replaceContainer): puts a prepared container in the place of an old one\n"
+                 "  OldIdentifier=ID OldContainerClass=N OldContainerUUID=UUID [OldPersonaUniqueString=S]\n"
+                 "  NewIdentifier=ID NewContainerClass=N NewContainerUUID=UUID [NewPersonaUniqueString=S]\n"
+                 "  Without the Old keys the new container is made permanent in its class.\n");
     return out == stdout ? 0 : 2;
 }
 
@@ -72,7 +78,8 @@ int main(int argc, char** argv) {
         return 2;
     }
     std::string name = subcommand ? std::string() : argv[i++];
-    std::optional<uint64_t> number = subcommand ? std::optional<uint64_t>(0) : commandNumberForName(name.c_str());
+    std::optional<uint64_t> number = subcommand ? std::optional<uint64_t>(0)
+                                                : commandNumberForName(name == "replace" ? "replaceContainer" : name.c_str());
     if (!number) {
         char* end = nullptr;
         unsigned long long n = std::strtoull(name.c_str(), &end, 10);
