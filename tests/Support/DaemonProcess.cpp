@@ -121,7 +121,9 @@ bool DaemonProcess::start(const std::vector<std::string>& extraEnvironment) {
         ::_exit(127);
     }
     // Ready once a request gets a reply (start-up finishes before connections are taken).
-    for (int i = 0; i < 400; i++) {
+    // Generous: a loaded two-core machine can take many seconds to start a process.
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
+    while (std::chrono::steady_clock::now() < deadline) {
         int status = 0;
         if (::waitpid(pid_, &status, WNOHANG) == pid_) {
             pid_ = -1;
