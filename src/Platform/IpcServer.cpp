@@ -122,13 +122,14 @@ bool IpcServer::stop(std::optional<std::chrono::milliseconds> grace) {
     stopped_ = true;
     std::optional<std::chrono::steady_clock::time_point> deadline;
     if (grace) deadline = std::chrono::steady_clock::now() + *grace;
-    const bool finished = loop_->stop(deadline);
-    // Remove the file only while it is still ours, then let the next server in.
+    // First the name goes (only while it is still ours), so that no client reaches a
+    // server that is stopping; the next server gets in once the loop has stopped.
     struct stat st;
     if (!path_.empty() && ::lstat(path_.c_str(), &st) == 0 && st.st_dev == socketDev_ &&
         st.st_ino == socketIno_) {
         ::unlink(path_.c_str());
     }
+    const bool finished = loop_->stop(deadline);
     if (lockFd_ >= 0) ::close(lockFd_);
     lockFd_ = -1;
     return finished;
