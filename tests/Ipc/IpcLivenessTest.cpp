@@ -6,7 +6,6 @@
 #include <unistd.h>
 
 #include <atomic>
-#include <mutex>
 #include <sstream>
 #include <thread>
 #include <vector>
@@ -27,8 +26,6 @@ namespace {
 
 // How long a served client may wait for its answer before the server counts as deaf.
 constexpr auto kAnswerWithin = std::chrono::seconds(5);
-
-Value echoOf(const IpcMessage& m) { return dict({{"Echo", m.body}}); }
 
 class IpcLivenessTest : public ::testing::Test {
 protected:
@@ -201,15 +198,10 @@ TEST_F(IpcLivenessTest, ConnectionsOverAUsersShareOrOverTheTotalAreRefusedWithAR
 }
 
 TEST_F(IpcLivenessTest, ClosesConnectionsLeftIdleButNotOnesInUseOrAwaitingAReply) {
-    std::mutex mutex;
-    std::vector<std::pair<std::shared_ptr<IpcPeer>, uint64_t>> held;
+    Unanswered held;
     IpcServerOptions options;
     options.onMessage = [&](std::shared_ptr<IpcPeer> peer, IpcMessage m) {
-        if (m.body.find("Hold")) {
-            std::lock_guard lock(mutex);
-            held.emplace_back(peer, m.id);
-            return;
-        }
+        if (m.body.find("Hold")) return held.keep(peer, m.id);
         peer->sendReply(m.id, echoOf(m));
     };
     options.idleConnectionTimeout = std::chrono::milliseconds(100);
@@ -231,12 +223,8 @@ TEST_F(IpcLivenessTest, ClosesConnectionsLeftIdleButNotOnesInUseOrAwaitingAReply
     EXPECT_TRUE(idle.waitForClose(kAnswerWithin));
     // The one awaiting its reply stays open however long the reply takes.
     EXPECT_FALSE(waiting.waitForClose(std::chrono::milliseconds(400)));
-    {
-        std::lock_guard lock(mutex);
-        ASSERT_EQ(held.size(), 1u);
-        EXPECT_TRUE(held[0].first->sendReply(held[0].second, dict({})));
-        held.clear();
-    }
+    ASSERT_EQ(held.size(), 1u);
+    EXPECT_TRUE(held.answerOldest(dict({})));
     auto late = waiting.readFrame(kAnswerWithin);
     ASSERT_TRUE(late);
     EXPECT_EQ(late->messageId, 1u);

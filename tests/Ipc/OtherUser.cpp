@@ -27,22 +27,11 @@ long nowMs() {
     return t.tv_sec * 1000 + t.tv_nsec / 1000000;
 }
 
-bool writeAll(int fd, const void* data, size_t size) {
-    const char* p = static_cast<const char*>(data);
-    while (size > 0) {
-        const ssize_t n = ::write(fd, p, size);
-        if (n < 0 && errno == EINTR) continue;
-        if (n <= 0) return false;
-        p += n;
-        size -= static_cast<size_t>(n);
-    }
-    return true;
-}
-
-bool readAll(int fd, void* data, size_t size) {
+// Moves exactly size bytes through a pipe, either way.
+bool transferAll(int fd, void* data, size_t size, bool writing) {
     char* p = static_cast<char*>(data);
     while (size > 0) {
-        const ssize_t n = ::read(fd, p, size);
+        const ssize_t n = writing ? ::write(fd, p, size) : ::read(fd, p, size);
         if (n < 0 && errno == EINTR) continue;
         if (n <= 0) return false;
         p += n;
@@ -94,7 +83,10 @@ size_t readOneFrame(int fd, char* buffer, long deadline) {
     const long deadline = nowMs() + kReplyWaitMs;
     for (size_t i = 0; i < count; ++i) {
         const uint32_t size = static_cast<uint32_t>(readOneFrame(fds[i], buffer, deadline));
-        if (!writeAll(report, &size, sizeof size) || !writeAll(report, buffer, size)) ::_exit(121);
+        uint32_t sizeCopy = size;
+        if (!transferAll(report, &sizeCopy, sizeof sizeCopy, true) || !transferAll(report, buffer, size, true)) {
+            ::_exit(121);
+        }
     }
     char byte;
     [[maybe_unused]] ssize_t n = ::read(release, &byte, 1);
@@ -121,9 +113,9 @@ HeldConnections::HeldConnections(const std::string& path, uid_t uid, size_t coun
     std::string bytes;
     for (size_t i = 0; i < count; ++i) {
         uint32_t size = 0;
-        if (!readAll(report[0], &size, sizeof size)) break;
+        if (!transferAll(report[0], &size, sizeof size, false)) break;
         bytes.assign(size, '\0');
-        if (size > 0 && !readAll(report[0], bytes.data(), size)) break;
+        if (size > 0 && !transferAll(report[0], bytes.data(), size, false)) break;
         std::optional<IpcFrame> frame;
         if (size > kIpcLengthPrefix) {
             frame = decodeFrameBody(reinterpret_cast<const uint8_t*>(bytes.data()) + kIpcLengthPrefix,
