@@ -1,10 +1,15 @@
 // A real daemon against a handler stuck for long, a user holding its whole share of
 // connections, and a stream of lookups with the default log settings.
+#include <fcntl.h>
 #include <gtest/gtest.h>
+#include <signal.h>
 #include <limits.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
+#include <cerrno>
 #include <chrono>
 #include <climits>
 #include <cstdlib>
@@ -120,6 +125,61 @@ TEST(DaemonLiveness, AUserAtItsConnectionCapIsToldSoWhileOtherUsersAreServed) {
     std::string gone;
     EXPECT_EQ(runProgramAs(0, ctl, &gone), 3);
     EXPECT_NE(gone.find("vesseld is not running"), std::string::npos) << gone;
+}
+
+TEST(DaemonLiveness, ConnectionsBeyondWhatTheDescriptorLimitAllowsAreRefusedNotLeftHanging) {
+    DaemonProcess daemon;
+    const std::string program = vesseldPath();
+    const std::string stderrPath = daemon.at("vesseld.stderr");
+    // A daemon whose descriptor limit is 256, soft and hard.
+    const pid_t pid = ::fork();
+    if (pid == 0) {
+        const rlimit low{256, 256};
+        const int log = ::open(stderrPath.c_str(), O_WRONLY | O_CREAT | O_APPEND, 0644);
+        if (::setrlimit(RLIMIT_NOFILE, &low) != 0 || log < 0) ::_exit(126);
+        ::dup2(log, 2);
+        ::setenv("VESSELD_OSLOG", "off", 1);
+        ::execl(program.c_str(), "vesseld", "--root", daemon.root().c_str(), "--init", nullptr);
+        ::_exit(127);
+    }
+    ASSERT_GT(pid, 0);
+    auto stop = [pid] {
+        ::kill(pid, SIGTERM);
+        int status = 0;
+        while (::waitpid(pid, &status, 0) < 0 && errno == EINTR) {
+        }
+        return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+    };
+    DaemonProcess::CtlResult r;
+    for (int i = 0; i < 400 && r.code() != 1u; ++i) {
+        r = lookup(daemon, "com.example.crowded", 10);
+        if (r.code() != 1u) std::this_thread::sleep_for(std::chrono::milliseconds(25));
+    }
+    ASSERT_EQ(r.code(), 1u) << r.err << readFile(daemon.at("vesseld.stderr"));
+
+    // Two clients of root, whose own share is larger than the total: the total stops them.
+    const std::string request = *encodeFrame(1, 0, dict({{"Command", Value::uint64(27)}}));
+    {
+        HeldConnections first(daemon.socketPath(), 0, 150, request);
+        HeldConnections second(daemon.socketPath(), 0, 150, request);
+        EXPECT_EQ(first.replies(), 150u);
+        ASSERT_EQ(second.frames().size(), 150u);
+        EXPECT_GT(second.refusals(), 0u);
+        EXPECT_EQ(second.replies() + second.refusals(), 150u) << "every connection answered or refused at once";
+        r = lookup(daemon, "com.example.crowded", 10);
+        EXPECT_EQ(r.exitCode, 3);
+        EXPECT_NE(r.err.find("too many connections to the daemon"), std::string::npos) << r.err;
+    }
+    for (int i = 0; i < 100; ++i) {
+        r = lookup(daemon, "com.example.crowded", 10);
+        if (r.exitCode != 3) break;
+        std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    }
+    EXPECT_EQ(r.code(), 1u) << r.err;
+    EXPECT_EQ(stop(), 0);
+    const std::string log = readFile(logPath(daemon));
+    EXPECT_NE(log.find("Connection limit reached: "), std::string::npos) << log;
+    EXPECT_EQ(readFile(daemon.at("vesseld.stderr")).find("Too many open files"), std::string::npos);
 }
 
 TEST(DaemonLogVolume, LookupsWriteNoLogLinesUnlessALevelAsksForThem) {
