@@ -181,7 +181,11 @@ bool VSLConnection::writeFrame(const std::string& frame, std::optional<Clock::ti
         if (n < 0 && errno == EINTR) continue;
         if (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK) {
             const std::string why = std::string("write failed: ") + std::strerror(errno);
-            if (!reading) readLastWords();
+            if (reading) {
+                receiveAvailable();
+            } else {
+                readLastWords();
+            }
             std::lock_guard lock(mutex_);
             failLocked(why);
             break;

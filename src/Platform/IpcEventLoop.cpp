@@ -315,10 +315,14 @@ void IpcEventLoop::willBeIdle() {
     ++idle_;
 }
 
-void IpcEventLoop::forget(uint64_t serial) {
+void IpcEventLoop::closed(const std::shared_ptr<IpcPeer>& peer) {
+    if (options_.onDisconnect) {
+        // The peer keeps the loop, and so these options, alive.
+        disconnects_->async(peer->queue(), [peer] { peer->loop_->options().onDisconnect(peer); });
+    }
     std::shared_ptr<IpcPeer> dropped;  // released outside the lock
     std::lock_guard lock(mutex_);
-    auto it = peers_.find(serial);
+    auto it = peers_.find(peer->serial());
     if (it == peers_.end()) return;
     dropped = std::move(it->second);
     peers_.erase(it);
@@ -327,16 +331,18 @@ void IpcEventLoop::forget(uint64_t serial) {
 
 namespace {
 
+// What is left of a deadline, for waits that take a timeout.
+std::optional<std::chrono::milliseconds> timeLeft(std::optional<Clock::time_point> deadline) {
+    if (!deadline) return std::nullopt;
+    const auto left = std::chrono::ceil<std::chrono::milliseconds>(*deadline - Clock::now());
+    return std::max(left, std::chrono::milliseconds(0));
+}
+
 // Waits for the work already on queue; false when the deadline came first.
 bool drained(const std::shared_ptr<WorkQueue>& queue, std::optional<Clock::time_point> deadline) {
-    if (!deadline) {
-        queue->sync([] {});
-        return true;
-    }
     auto group = WorkGroup::create();
     group->async(queue, [] {});
-    const auto left = std::chrono::ceil<std::chrono::milliseconds>(*deadline - Clock::now());
-    return group->wait(std::max(left, std::chrono::milliseconds(0)));
+    return group->wait(timeLeft(deadline));
 }
 
 }  // namespace
@@ -375,6 +381,7 @@ bool IpcEventLoop::stop(std::optional<Clock::time_point> deadline) {
         if (!queuesDone) break;
         queuesDone = drained(peer->queue(), deadline);
     }
+    if (queuesDone) queuesDone = disconnects_->wait(timeLeft(deadline));
     return threadsGone && queuesDone;
 }
 

@@ -32,7 +32,8 @@ public:
 
     const IpcServerOptions& options() const { return options_; }
     int epollFd() const { return epollFd_; }
-    void forget(uint64_t serial);
+    // A peer has closed: queues its disconnect handler, then drops it from the table.
+    void closed(const std::shared_ptr<IpcPeer>& peer);
     // Called by an I/O thread just before it rearms what it served: it counts as
     // idle from then on, so the event the rearm may fire at once does not make
     // another thread think everybody is busy.
@@ -56,7 +57,6 @@ private:
     // Counts a new connection of uid against the limits; the refusal text when over one.
     std::optional<std::string> reserveLocked(uid_t uid);
     void releaseLocked(uid_t uid);
-    void armTimer();
     void closeIdlePeers();
 
     const IpcServerOptions options_;
@@ -69,6 +69,9 @@ private:
 
     mutable std::mutex mutex_;
     std::condition_variable threadExited_;
+    // Disconnect handlers queued and not yet run, which a stop waits for: a peer that
+    // left the table just before the stop looked is no longer among those it drains.
+    const std::shared_ptr<WorkGroup> disconnects_ = WorkGroup::create();
     std::unordered_map<uint64_t, std::shared_ptr<IpcPeer>> peers_;
     // Admitted and being admitted, per uid and in all.
     std::unordered_map<uid_t, UidConnections> perUid_;

@@ -247,12 +247,7 @@ bool IpcPeer::markClosedLocked(const char* why) {
     return true;
 }
 
-void IpcPeer::finishClose() {
-    loop_->forget(serial_);
-    if (loop_->options().onDisconnect) {
-        queue_->async([self = shared_from_this()] { self->loop_->options().onDisconnect(self); });
-    }
-}
+void IpcPeer::finishClose() { loop_->closed(shared_from_this()); }
 
 std::string IpcPeer::description() const {
     return "<peer " + std::to_string(serial_) + ": pid " + std::to_string(credentials_.pid) +

@@ -233,3 +233,28 @@ TEST_F(IpcLivenessTest, ClosesConnectionsLeftIdleButNotOnesInUseOrAwaitingAReply
     EXPECT_TRUE(busy.waitForClose(kAnswerWithin));
     EXPECT_EQ(server->peerCount(), 0u);
 }
+
+TEST_F(IpcLivenessTest, AStopWaitsForTheDisconnectHandlersOfPeersThatLeftJustBefore) {
+    std::atomic<int> finished{0};
+    IpcServerOptions options;
+    options.onMessage = [](std::shared_ptr<IpcPeer> peer, IpcMessage m) { peer->sendReply(m.id, echoOf(m)); };
+    options.onDisconnect = [&](std::shared_ptr<IpcPeer>) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(200));
+        ++finished;
+    };
+    auto server = start(std::move(options));
+    ASSERT_TRUE(server);
+    {
+        RawClient gone(path_ + ".a");
+        ASSERT_TRUE(gone.sendRequest(1, dict({})));
+        ASSERT_TRUE(gone.readFrame());
+    }
+    // Out of the table, its handler still running: the stop must not return before it.
+    const auto end = std::chrono::steady_clock::now() + kPatience;
+    while (server->peerCount() > 0 && std::chrono::steady_clock::now() < end) {
+        std::this_thread::yield();
+    }
+    ASSERT_EQ(finished.load(), 0);
+    server->stop();
+    EXPECT_EQ(finished.load(), 1);
+}
