@@ -22,10 +22,10 @@ void delayForTests(const Value& body) {
     };
     static const Delay delay = [] {
         Delay d;
-        const char* spec = std::getenv("VESSELD_TEST_HANDLER_DELAY");
-        if (!spec) return d;
+        const char* setting = std::getenv("VESSELD_TEST_HANDLER_DELAY");
+        if (!setting) return d;
         char* end = nullptr;
-        d.command = std::strtoull(spec, &end, 10);
+        d.command = std::strtoull(setting, &end, 10);
         if (end && *end == ':') d.seconds = static_cast<unsigned>(std::strtoul(end + 1, nullptr, 10));
         return d;
     }();
