@@ -40,6 +40,7 @@ const char* statusName(VSLConnectionStatus status) {
     case VSLConnectionStatus::InvalidRequest: return "invalid request";
     case VSLConnectionStatus::Timeout: return "timed out";
     case VSLConnectionStatus::Closed: return "connection closed";
+    case VSLConnectionStatus::Refused: return "connection refused";
     }
     return "unknown";
 }
@@ -65,8 +66,10 @@ std::shared_ptr<VSLConnection> VSLConnection::connect(const std::string& socketP
     std::memcpy(addr.sun_path, socketPath.c_str(), socketPath.size() + 1);
     const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
     if (fd < 0 || ::connect(fd, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0) {
-        if (error) *error = "cannot connect to " + socketPath + ": " + std::strerror(errno);
+        const int saved = errno;
+        if (error) *error = "cannot connect to " + socketPath + ": " + std::strerror(saved);
         if (fd >= 0) ::close(fd);
+        errno = saved;
         return nullptr;
     }
     // Waits happen in poll(), where the deadlines live.
@@ -91,9 +94,15 @@ bool VSLConnection::isClosed() const {
     return closed_;
 }
 
-void VSLConnection::failLocked(const std::string& reason) {
+bool VSLConnection::wasRefused() const {
+    std::lock_guard lock(mutex_);
+    return refused_;
+}
+
+void VSLConnection::failLocked(const std::string& reason, bool refused) {
     if (closed_) return;
     closed_ = true;
+    refused_ = refused;
     closeReason_ = reason;
     // Wakes a reader blocked in poll(); the descriptor stays valid until destruction.
     ::shutdown(fd_, SHUT_RDWR);
@@ -117,7 +126,7 @@ VSLReply VSLConnection::sendRequest(const Value& request, std::optional<std::chr
     uint64_t id;
     {
         std::lock_guard lock(mutex_);
-        if (closed_) return {VSLConnectionStatus::Closed, {}, closeReason_};
+        if (closed_) return {closedStatusLocked(), {}, closeReason_};
         id = nextId_++;
     }
     std::string error;
@@ -125,7 +134,7 @@ VSLReply VSLConnection::sendRequest(const Value& request, std::optional<std::chr
     if (!frame) return {VSLConnectionStatus::InvalidRequest, {}, error};
     {
         std::lock_guard lock(mutex_);
-        if (closed_) return {VSLConnectionStatus::Closed, {}, closeReason_};
+        if (closed_) return {closedStatusLocked(), {}, closeReason_};
         pending_.emplace(id, &mine);
     }
     const bool written = writeFrame(*frame, deadline);
@@ -138,7 +147,7 @@ VSLReply VSLConnection::sendRequest(const Value& request, std::optional<std::chr
     for (;;) {
         if (mine.done) return {VSLConnectionStatus::Ok, std::move(mine.reply), {}};
         if (!written) return finish(VSLConnectionStatus::Timeout, closeReason_);
-        if (closed_) return finish(VSLConnectionStatus::Closed, closeReason_);
+        if (closed_) return finish(closedStatusLocked(), closeReason_);
         if (!readerActive_) {
             readerActive_ = true;
             lock.unlock();
@@ -171,8 +180,14 @@ bool VSLConnection::writeFrame(const std::string& frame, std::optional<Clock::ti
         }
         if (n < 0 && errno == EINTR) continue;
         if (n < 0 && errno != EAGAIN && errno != EWOULDBLOCK) {
+            const std::string why = std::string("write failed: ") + std::strerror(errno);
+            if (reading) {
+                receiveAvailable();
+            } else {
+                readLastWords();
+            }
             std::lock_guard lock(mutex_);
-            failLocked(std::string("write failed: ") + std::strerror(errno));
+            failLocked(why);
             break;
         }
         // The server stops reading while its replies to us are unread: read them
@@ -203,6 +218,18 @@ bool VSLConnection::writeFrame(const std::string& frame, std::optional<Clock::ti
         handOffReaderLocked();
     }
     return ok;
+}
+
+void VSLConnection::readLastWords() {
+    {
+        std::lock_guard lock(mutex_);
+        // The caller that reads now sees the same bytes.
+        if (readerActive_) return;
+        readerActive_ = true;
+    }
+    receiveAvailable();
+    std::lock_guard lock(mutex_);
+    handOffReaderLocked();
 }
 
 bool VSLConnection::readUntil(Pending& mine, std::optional<Clock::time_point> deadline) {
@@ -249,6 +276,12 @@ void VSLConnection::receiveAvailable() {
         std::lock_guard lock(mutex_);
         if (!frame || frame->flags != kIpcFlagReply) {
             failLocked("protocol error: " + (frame ? std::string("not a reply") : error));
+            return;
+        }
+        if (frame->messageId == kIpcNoticeMessageId) {
+            const std::string* reason = nullptr;
+            if (const Value* v = frame->body.find(kIpcRefusalKey)) reason = v->stringValue();
+            failLocked(reason ? *reason : "refused by the server", true);
             return;
         }
         auto it = pending_.find(frame->messageId);

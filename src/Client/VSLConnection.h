@@ -3,6 +3,10 @@
 // paired with its request by message id, whatever order they come back in. A
 // waiting caller reads the socket itself when no other caller is reading, so a
 // single-threaded client pays no thread hand-off.
+//
+// The daemon limits the connections each uid may hold and closes one that stays
+// unused for long (docs/operations.md): a long-lived client reconnects when it finds
+// its connection Closed, and a Refused one has too many open already.
 #pragma once
 
 #include <chrono>
@@ -23,6 +27,7 @@ enum class VSLConnectionStatus {
     InvalidRequest,  // the request cannot be encoded (not a dictionary, bad string, ...)
     Timeout,         // no reply in time; a late reply is dropped
     Closed,          // the connection is closed (by either side, or a protocol error)
+    Refused,         // the server refused the connection: its caller holds too many
 };
 
 const char* statusName(VSLConnectionStatus status);
@@ -39,7 +44,8 @@ class VSLConnection {
     struct Passkey {};
 
 public:
-    // Connects to a socket path; none with a reason on failure.
+    // Connects to a socket path; none with a reason on failure, errno as connect(2)
+    // left it (ENOENT or ECONNREFUSED: no server there).
     static std::shared_ptr<VSLConnection> connect(const std::string& socketPath,
                                                   std::string* error = nullptr);
     // Connects to "run/vesseld/com.tarrow.vesseld" below a system root ("/" in production).
@@ -59,6 +65,7 @@ public:
     // Closes the connection; callers waiting on it get Closed.
     void close();
     bool isClosed() const;
+    bool wasRefused() const;
 
 private:
     struct Pending;
@@ -71,13 +78,19 @@ private:
     void receiveAvailable();
     // False when the deadline passed with the frame partly written.
     bool writeFrame(const std::string& frame, std::optional<Clock::time_point> deadline);
-    void failLocked(const std::string& reason);
+    void failLocked(const std::string& reason, bool refused = false);
+    VSLConnectionStatus closedStatusLocked() const {
+        return refused_ ? VSLConnectionStatus::Refused : VSLConnectionStatus::Closed;
+    }
+    // After a failed write: reads what the server said before it hung up.
+    void readLastWords();
     void handOffReaderLocked();
 
     const int fd_;
     mutable std::mutex mutex_;
     std::mutex writeMutex_;
     bool closed_ = false;
+    bool refused_ = false;
     std::string closeReason_;
     bool readerActive_ = false;
     uint64_t nextId_ = 1;

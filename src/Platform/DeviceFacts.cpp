@@ -38,6 +38,11 @@ DeviceFacts load() {
                 f.installerUID = static_cast<uid_t>(*p->unsignedNumber());
             if (auto p = v->find("SystemContainerUID"); p && p->unsignedNumber())
                 f.systemContainerUID = static_cast<uid_t>(*p->unsignedNumber());
+            if (auto p = v->find("LogLevel")) {
+                if (auto name = p->stringValue()) f.logLevel = logVerbosityNamed(*name);
+                else if (auto n = p->signedNumber()) f.logLevel = logVerbosityForLevel(*n);
+                if (!f.logLevel) LogWrite(kLogLevelError, "DeviceFacts", "device.plist: LogLevel %@ is not a log level; ignored", *p);
+            }
             if (auto p = v->find("FeatureFlags"); p && p->dictionaryValue())
                 for (const auto& [k, val] : *p->dictionaryValue())
                     if (val.boolValue()) f.featureFlags[k] = *val.boolValue();

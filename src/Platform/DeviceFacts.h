@@ -5,7 +5,10 @@
 #include <sys/types.h>
 
 #include <map>
+#include <optional>
 #include <string>
+
+#include "Platform/Log.h"
 
 namespace vsl {
 
@@ -20,6 +23,8 @@ struct DeviceFacts {
     uid_t installerUID = 33;
     uid_t systemContainerUID = 0;
     std::string buildVersion;  // BUILD_ID of etc/os-release, "" when absent
+    // "LogLevel": a name ("error", "default", "info", "debug") or 3, 5, 6, 7.
+    std::optional<LogVerbosity> logLevel;
 
     bool featureEnabled(const std::string& name) const {
         auto it = featureFlags.find(name);

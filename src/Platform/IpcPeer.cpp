@@ -60,6 +60,7 @@ void IpcPeer::service() {
         std::lock_guard lock(mutex_);
         armed_ = false;
         if (closed_) return;
+        lastUse_ = std::chrono::steady_clock::now();
         if (!outbox_.empty() && !flushLocked()) why = "write failed";
     }
     bool open = why == nullptr;
@@ -168,6 +169,7 @@ bool IpcPeer::sendReply(uint64_t messageId, const Value& body) {
             answered.emplace(std::move(it->second));
             pending_.erase(it);
         }
+        lastUse_ = std::chrono::steady_clock::now();
         const bool idle = outbox_.empty();
         outbox_.append(*frame);
         if (idle && !flushLocked()) {
@@ -208,6 +210,16 @@ bool IpcPeer::flushLocked() {
     return true;
 }
 
+void IpcPeer::closeIfIdleSince(std::chrono::steady_clock::time_point cutoff) {
+    bool closing;
+    {
+        std::lock_guard lock(mutex_);
+        if (closed_ || !armed_ || !outbox_.empty() || !pending_.empty() || lastUse_ > cutoff) return;
+        closing = markClosedLocked("idle");
+    }
+    if (closing) finishClose();
+}
+
 void IpcPeer::cancel() {
     bool closing;
     {
@@ -235,12 +247,7 @@ bool IpcPeer::markClosedLocked(const char* why) {
     return true;
 }
 
-void IpcPeer::finishClose() {
-    loop_->forget(serial_);
-    if (loop_->options().onDisconnect) {
-        queue_->async([self = shared_from_this()] { self->loop_->options().onDisconnect(self); });
-    }
-}
+void IpcPeer::finishClose() { loop_->closed(shared_from_this()); }
 
 std::string IpcPeer::description() const {
     return "<peer " + std::to_string(serial_) + ": pid " + std::to_string(credentials_.pid) +

@@ -4,6 +4,7 @@
 
 #include <sys/types.h>
 
+#include <chrono>
 #include <cstdint>
 #include <memory>
 #include <mutex>
@@ -74,6 +75,9 @@ private:
     // First registration, once the connection handler has run.
     void arm();
     void rearmLocked();
+    // Closes the connection when it waits for input with nothing owed either way and
+    // has not been used since cutoff.
+    void closeIfIdleSince(std::chrono::steady_clock::time_point cutoff);
     bool flushLocked();
     bool markClosedLocked(const char* why);
     void finishClose();
@@ -95,6 +99,7 @@ private:
     bool registered_ = false;  // added to the epoll set
     bool armed_ = false;       // waiting there for readiness
     std::string outbox_;       // reply bytes the socket did not take yet
+    std::chrono::steady_clock::time_point lastUse_ = std::chrono::steady_clock::now();
     // A message handled but not yet answered keeps the process alive, as a pending
     // reply does; the transaction ends with the reply or with the peer.
     std::unordered_multimap<uint64_t, Transaction> pending_;

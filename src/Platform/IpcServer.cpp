@@ -116,23 +116,29 @@ IpcServer::IpcServer(std::shared_ptr<IpcEventLoop> loop, std::string path, int l
 
 IpcServer::~IpcServer() { stop(); }
 
-void IpcServer::stop() {
+bool IpcServer::stop(std::optional<std::chrono::milliseconds> grace) {
     std::lock_guard lock(stopMutex_);
-    if (stopped_) return;
+    if (stopped_) return true;
     stopped_ = true;
-    loop_->stop();
-    // Remove the file only while it is still ours, then let the next server in.
+    std::optional<std::chrono::steady_clock::time_point> deadline;
+    if (grace) deadline = std::chrono::steady_clock::now() + *grace;
+    // First the name goes (only while it is still ours), so that no client reaches a
+    // server that is stopping; the next server gets in once the loop has stopped.
     struct stat st;
     if (!path_.empty() && ::lstat(path_.c_str(), &st) == 0 && st.st_dev == socketDev_ &&
         st.st_ino == socketIno_) {
         ::unlink(path_.c_str());
     }
+    const bool finished = loop_->stop(deadline);
     if (lockFd_ >= 0) ::close(lockFd_);
     lockFd_ = -1;
+    return finished;
 }
 
 size_t IpcServer::peerCount() const { return loop_->peerCount(); }
 
 size_t IpcServer::ioThreadCount() const { return loop_->threadCount(); }
+
+size_t IpcServer::connectionLimit() const { return loop_->connectionLimit(); }
 
 }  // namespace vsl

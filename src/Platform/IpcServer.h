@@ -8,7 +8,13 @@
 // a sync onto the peer's queue, which runs inline when the queue is free), so the
 // request path costs one wake-up, as a thread per connection would, while idle
 // connections cost no thread. A thread about to run a handler makes sure another
-// one still waits for events, so a blocked handler delays only its own peer.
+// one still waits for events (an idle thread leaves only while another idle one
+// stays, and at the thread cap the handler is handed to the peer's queue instead),
+// so a blocked handler delays only its own peer.
+//
+// Connections are limited per uid and in total, and long-idle ones are closed, so
+// no local user can take every descriptor. A connection over a limit gets one
+// notice frame (message id 0, see IpcWire.h) and is closed.
 //
 // A frame that does not decode closes that connection and nothing else.
 #pragma once
@@ -19,6 +25,7 @@
 #include <functional>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 
 #include "Platform/IpcPeer.h"
@@ -41,6 +48,16 @@ struct IpcServerOptions {
     std::function<void(std::shared_ptr<IpcPeer>)> onDisconnect;
     size_t maxIoThreads = 64;
     std::chrono::milliseconds ioThreadIdleTimeout{5000};
+    // Open connections per peer uid; 0 for no limit. Uid 0 and the server's own
+    // effective uid have maxConnectionsPrivileged instead.
+    size_t maxConnectionsPerUid = 0;
+    size_t maxConnectionsPrivileged = 0;
+    // Open connections in all; 0 for a limit derived from the descriptor limit at
+    // start, leaving room for the descriptors that handlers use.
+    size_t maxConnections = 0;
+    // A connection with no request, no unanswered message and no unsent reply for
+    // this long is closed; 0 never closes one.
+    std::chrono::milliseconds idleConnectionTimeout{0};
 };
 
 class IpcServer {
@@ -56,11 +73,15 @@ public:
     // Stops accepting, closes every peer, waits for running handlers and for the
     // peers' disconnect handlers, and removes the socket file. Must not be called
     // from a handler. Replies sent later from completions are refused.
-    void stop();
+    // With a grace, waits at most that long: false when handlers were still running
+    // then. They finish on their own later, so whatever they use must outlive them
+    // (the daemon exits instead). A later call returns at once.
+    bool stop(std::optional<std::chrono::milliseconds> grace = std::nullopt);
 
     const std::string& path() const { return path_; }
     size_t peerCount() const;
     size_t ioThreadCount() const;
+    size_t connectionLimit() const;  // the total in force
 
 private:
     IpcServer(std::shared_ptr<IpcEventLoop> loop, std::string path, int lockFd);

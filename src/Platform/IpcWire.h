@@ -20,6 +20,12 @@ constexpr size_t kIpcLengthPrefix = 4;
 constexpr size_t kIpcHeaderLength = 16;  // magic, version, flags, message id
 constexpr size_t kIpcMaxDepth = 64;      // the body dictionary is level 1
 
+// Message id 0 is never a request's: a reply frame carrying it is the server's notice
+// that it refused the connection, sent just before it closes it. Its body holds the
+// reason under kIpcRefusalKey (a string).
+constexpr uint64_t kIpcNoticeMessageId = 0;
+inline constexpr const char* kIpcRefusalKey = "ReplyConnectionRefused";
+
 struct IpcFrame {
     uint64_t messageId = 0;
     uint16_t flags = 0;

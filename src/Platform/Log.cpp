@@ -45,8 +45,8 @@ std::string timestamp() {
     return buffer;
 }
 
-// -1 until the environment has been read.
-std::atomic<int> gDebug{-1};
+// A LogVerbosity, or -1 until the environment has been read.
+std::atomic<int> gVerbosity{-1};
 std::atomic<bool> gMirrorToStderr{false};
 
 struct FileLog {
@@ -170,7 +170,16 @@ void sendRecordToJournal(const OSLogRecord& r) {
     if (rc < 0) writeRecordToStderr(r);  // the journal went away: keep the line
 }
 
-bool osLogWanted() { return gHasSink.load(std::memory_order_acquire) || osLogMode() != OSLogMode::Off; }
+LogVerbosity verbosityForOSLogLevel(OSLogLevel level) {
+    switch (level) {
+    case OSLogLevel::Debug: return LogVerbosity::Debug;
+    case OSLogLevel::Info: return LogVerbosity::Info;
+    case OSLogLevel::Default: return LogVerbosity::Default;
+    case OSLogLevel::Error:
+    case OSLogLevel::Fault: return LogVerbosity::Error;
+    }
+    return LogVerbosity::Default;
+}
 
 void emitRecord(const OSLogRecord& r) {
     if (gHasSink.load(std::memory_order_acquire)) {
@@ -215,16 +224,40 @@ void closeLogFile() {
 
 void setLogWriteToStderr(bool on) { gMirrorToStderr.store(on, std::memory_order_relaxed); }
 
-void setDebugLogging(bool on) { gDebug.store(on ? 1 : 0, std::memory_order_relaxed); }
-
-bool isDebugLogging() {
-    int state = gDebug.load(std::memory_order_relaxed);
-    if (state >= 0) return state != 0;
+LogVerbosity logVerbosity() {
+    int state = gVerbosity.load(std::memory_order_relaxed);
+    if (state >= 0) return static_cast<LogVerbosity>(state);
     const char* env = std::getenv("VESSELD_DEBUG");
-    int fromEnv = env && *env && std::strcmp(env, "0") != 0 ? 1 : 0;
-    gDebug.compare_exchange_strong(state, fromEnv, std::memory_order_relaxed);
-    return gDebug.load(std::memory_order_relaxed) != 0;
+    const auto fromEnv = env && *env && std::strcmp(env, "0") != 0 ? LogVerbosity::Debug : LogVerbosity::Error;
+    gVerbosity.compare_exchange_strong(state, static_cast<int>(fromEnv), std::memory_order_relaxed);
+    return static_cast<LogVerbosity>(gVerbosity.load(std::memory_order_relaxed));
 }
+
+void setLogVerbosity(LogVerbosity verbosity) {
+    gVerbosity.store(static_cast<int>(verbosity), std::memory_order_relaxed);
+}
+
+std::optional<LogVerbosity> logVerbosityNamed(std::string_view name) {
+    if (name == "error") return LogVerbosity::Error;
+    if (name == "default" || name == "notice") return LogVerbosity::Default;
+    if (name == "info") return LogVerbosity::Info;
+    if (name == "debug") return LogVerbosity::Debug;
+    return std::nullopt;
+}
+
+std::optional<LogVerbosity> logVerbosityForLevel(int64_t level) {
+    switch (level) {
+    case kLogLevelError: return LogVerbosity::Error;
+    case kLogLevelNotice: return LogVerbosity::Default;
+    case 6: return LogVerbosity::Info;
+    case kLogLevelDebug: return LogVerbosity::Debug;
+    }
+    return std::nullopt;
+}
+
+void setDebugLogging(bool on) { setLogVerbosity(on ? LogVerbosity::Debug : LogVerbosity::Error); }
+
+bool isDebugLogging() { return logVerbosity() == LogVerbosity::Debug; }
 
 void logWriteLine(int level, const char* function, const std::string& message) {
     if (level >= kLogLevelDebug && !isDebugLogging()) return;
@@ -279,9 +312,17 @@ const char* logSubsystemName(LogCategory c) {
     return c == LogCategory::Daemon ? "com.tarrow.vesseld" : "com.tarrow.vessel";
 }
 
+bool osLogEnabled(OSLogLevel level) {
+    if (level == OSLogLevel::Debug && !isDebugLogging()) return false;
+    if (gHasSink.load(std::memory_order_acquire)) return true;
+    return osLogMode() != OSLogMode::Off && logVerbosity() >= verbosityForOSLogLevel(level);
+}
+
+// Signposts trace every request: they are written from Info on.
+bool signpostsEnabled() { return osLogEnabled(OSLogLevel::Info); }
+
 void osLogLine(LogCategory category, OSLogLevel level, const std::string& message) {
-    if (level == OSLogLevel::Debug && !isDebugLogging()) return;
-    if (!osLogWanted()) return;
+    if (!osLogEnabled(level)) return;
     OSLogRecord record{category, level, message};
     emitRecord(record);
 }
@@ -297,7 +338,7 @@ void setOSLogSink(std::function<void(const OSLogRecord&)> sink) {
 
 SignpostInterval::SignpostInterval(LogCategory category, const char* name, std::string attributes)
     : category_(category), name_(name ? name : ""), id_(gNextSignpostId.fetch_add(1, std::memory_order_relaxed)) {
-    if (!osLogWanted()) return;
+    if (!signpostsEnabled()) return;
     OSLogRecord record{category_, OSLogLevel::Default, std::move(attributes)};
     record.signpostEvent = "begin";
     record.signpostName = name_;
@@ -310,7 +351,7 @@ SignpostInterval::~SignpostInterval() { endWith(std::string()); }
 void SignpostInterval::endWith(std::string attributes) {
     if (ended_) return;
     ended_ = true;
-    if (!osLogWanted()) return;
+    if (!signpostsEnabled()) return;
     OSLogRecord record{category_, OSLogLevel::Default, std::move(attributes)};
     record.signpostEvent = "end";
     record.signpostName = name_;

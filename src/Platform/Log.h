@@ -7,6 +7,8 @@
 // description, the printf conversions (%s %d %u %ld %lld %llu %c %p %x %f, flags,
 // width, precision) print their values, and %{public}/%{private} annotations are
 // accepted and dropped. Debug lines are formatted only when debug logging is on.
+// What is written follows one verbosity (LogVerbosity below): errors always, the
+// rest only when asked for, so that serving a request costs no log line by default.
 #pragma once
 
 #include <concepts>
@@ -117,6 +119,21 @@ std::string formatLog(std::string_view format, const Args&... args) {
     return formatLogMessage(format, std::vector<LogArg>{makeLogArg(args)...});
 }
 
+// ---- verbosity ----
+
+// Error: errors and faults in the structured log; levels 3 and 5 in the file.
+// Default: also the structured log's default-level lines. Info: also its info lines
+// and signposts (one pair per request). Debug: also debug lines in both logs.
+enum class LogVerbosity { Error, Default, Info, Debug };
+
+// Error unless VESSELD_DEBUG=1 (Debug) until set otherwise.
+LogVerbosity logVerbosity();
+void setLogVerbosity(LogVerbosity verbosity);
+// "error", "default" (or "notice"), "info", "debug"; none for anything else.
+std::optional<LogVerbosity> logVerbosityNamed(std::string_view name);
+// 3, 5, 6, 7 as above; none for anything else.
+std::optional<LogVerbosity> logVerbosityForLevel(int64_t level);
+
 // ---- rotating file log ----
 
 constexpr int kLogLevelError = 3;
@@ -135,8 +152,8 @@ bool openLogFile(const LogFileOptions& options);
 void closeLogFile();
 // Also mirrors LogWrite lines to stderr (the daemon's foreground mode).
 void setLogWriteToStderr(bool on);
-void setDebugLogging(bool on);  // also VESSELD_DEBUG=1 in the environment
-bool isDebugLogging();
+void setDebugLogging(bool on);  // Debug, or back to Error
+bool isDebugLogging();          // logVerbosity() is Debug
 
 void logWriteLine(int level, const char* function, const std::string& message);
 
@@ -158,10 +175,14 @@ enum class OSLogLevel { Debug, Info, Default, Error, Fault };
 const char* logCategoryName(LogCategory c);
 const char* logSubsystemName(LogCategory c);
 void osLogLine(LogCategory category, OSLogLevel level, const std::string& message);
+// Whether a line of that level goes anywhere now (a test sink takes every line but
+// debug ones, which need Debug verbosity).
+bool osLogEnabled(OSLogLevel level);
+bool signpostsEnabled();
 
 template <class... Args>
 void osLog(LogCategory category, OSLogLevel level, std::string_view format, const Args&... args) {
-    if (level == OSLogLevel::Debug && !isDebugLogging()) return;
+    if (!osLogEnabled(level)) return;
     osLogLine(category, level, formatLog(format, args...));
 }
 
@@ -171,11 +192,13 @@ class SignpostInterval {
 public:
     template <class... Args>
     SignpostInterval(LogCategory category, const char* name, std::string_view format, const Args&... args)
-        : SignpostInterval(category, name, formatLog(format, args...)) {}
+        : SignpostInterval(category, name, signpostsEnabled() ? formatLog(format, args...) : std::string()) {}
     SignpostInterval(LogCategory category, const char* name, std::string attributes);
     ~SignpostInterval();  // emits the end event
     template <class... Args>
-    void end(std::string_view format, const Args&... args) { endWith(formatLog(format, args...)); }
+    void end(std::string_view format, const Args&... args) {
+        endWith(signpostsEnabled() ? formatLog(format, args...) : std::string());
+    }
     SignpostInterval(const SignpostInterval&) = delete;
     SignpostInterval& operator=(const SignpostInterval&) = delete;
 
@@ -197,8 +220,9 @@ struct OSLogRecord {
     const char* signpostName = nullptr;
     uint64_t signpostId = 0;
 };
-// While set, every structured-log record goes to the sink only; an empty function
-// restores the journal/stderr destination.
+// While set, every structured-log record goes to the sink only, whatever the
+// verbosity (debug lines still need Debug); an empty function restores the
+// journal/stderr destination.
 void setOSLogSink(std::function<void(const OSLogRecord&)> sink);
 
 }  // namespace vsl

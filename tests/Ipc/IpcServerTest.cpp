@@ -39,8 +39,6 @@ void leaveStaleSocket(const std::string& path, bool keepListening, int* listener
     }
 }
 
-Value echoOf(const IpcMessage& m) { return dict({{"Echo", m.body}}); }
-
 class IpcServerTest : public ::testing::Test {
 protected:
     void SetUp() override {
@@ -364,13 +362,11 @@ TEST_F(IpcServerTest, KnowsWhoIsCalling) {
 }
 
 TEST_F(IpcServerTest, ClientSurfacesTimeoutsRefusalsAndClosedConnections) {
-    std::mutex mutex;
-    std::vector<std::pair<std::shared_ptr<IpcPeer>, uint64_t>> unanswered;
+    Unanswered unanswered;
     IpcServerOptions options;
     options.onMessage = [&](std::shared_ptr<IpcPeer> peer, IpcMessage m) {
         if (m.body.find("Ignore")) {
-            std::lock_guard lock(mutex);
-            unanswered.emplace_back(peer, m.id);
+            unanswered.keep(peer, m.id);
         } else if (m.body.find("Hangup")) {
             peer->cancel();
             EXPECT_FALSE(peer->sendReply(m.id, dict({})));
@@ -388,11 +384,8 @@ TEST_F(IpcServerTest, ClientSurfacesTimeoutsRefusalsAndClosedConnections) {
     // While unanswered, the message keeps the process alive.
     auto names = openTransactionNames();
     EXPECT_EQ(std::count(names.begin(), names.end(), "com.tarrow.vesseld.peer-message"), 1);
-    {
-        std::lock_guard lock(mutex);
-        ASSERT_EQ(unanswered.size(), 1u);
-        EXPECT_TRUE(unanswered[0].first->sendReply(unanswered[0].second, dict({{"late", Value::boolean(true)}})));
-    }
+    ASSERT_EQ(unanswered.size(), 1u);
+    EXPECT_TRUE(unanswered.answerOldest(dict({{"late", Value::boolean(true)}})));
     names = openTransactionNames();
     EXPECT_EQ(std::count(names.begin(), names.end(), "com.tarrow.vesseld.peer-message"), 0);
     auto next = conn->sendRequest(dict({{"n", Value::uint64(2)}}));

@@ -10,6 +10,29 @@
 
 namespace vsl::test {
 
+Value echoOf(const IpcMessage& m) { return dict({{"Echo", m.body}}); }
+
+void Unanswered::keep(std::shared_ptr<IpcPeer> peer, uint64_t messageId) {
+    std::lock_guard lock(mutex_);
+    kept_.emplace_back(std::move(peer), messageId);
+}
+
+size_t Unanswered::size() {
+    std::lock_guard lock(mutex_);
+    return kept_.size();
+}
+
+bool Unanswered::answerOldest(const Value& body) {
+    std::pair<std::shared_ptr<IpcPeer>, uint64_t> oldest;
+    {
+        std::lock_guard lock(mutex_);
+        if (kept_.empty()) return false;
+        oldest = std::move(kept_.front());
+        kept_.pop_front();
+    }
+    return oldest.first->sendReply(oldest.second, body);
+}
+
 void Gate::open() {
     std::lock_guard lock(mutex_);
     open_ = true;

@@ -4,10 +4,14 @@
 
 #include <chrono>
 #include <condition_variable>
+#include <deque>
+#include <memory>
 #include <mutex>
 #include <optional>
 #include <string>
+#include <utility>
 
+#include "Platform/IpcPeer.h"
 #include "Platform/IpcWire.h"
 
 namespace vsl::test {
@@ -37,6 +41,22 @@ private:
     std::mutex mutex_;
     std::condition_variable cv_;
     size_t n_ = 0;
+};
+
+// What the test servers answer: {"Echo": the request's body}.
+Value echoOf(const IpcMessage& m);
+
+// Requests a test server keeps unanswered, for the test to answer later.
+class Unanswered {
+public:
+    void keep(std::shared_ptr<IpcPeer> peer, uint64_t messageId);
+    size_t size();
+    // Answers the oldest one with body; what sendReply returned.
+    bool answerOldest(const Value& body);
+
+private:
+    std::mutex mutex_;
+    std::deque<std::pair<std::shared_ptr<IpcPeer>, uint64_t>> kept_;
 };
 
 class RawClient {

@@ -49,11 +49,11 @@ std::vector<char*> cStrings(std::vector<std::string>& v) {
     return out;
 }
 
+// getenv() takes the first entry of a name: a test's own settings come first.
 std::vector<std::string> environmentWith(const std::vector<std::string>& extra) {
-    std::vector<std::string> env;
+    std::vector<std::string> env(extra);
     for (char** e = environ; *e; e++) env.emplace_back(*e);
     env.emplace_back("VESSELD_OSLOG=off");
-    for (const auto& x : extra) env.push_back(x);
     return env;
 }
 

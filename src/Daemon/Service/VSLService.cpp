@@ -2,14 +2,54 @@
 
 #include "Daemon/Service/VSLProcessIPCEvent.h"
 
+#ifdef VESSEL_KILLPOINTS
+#include <cstdlib>
+#include <thread>
+#endif
+
 namespace vsl {
+
+namespace {
+
+#ifdef VESSEL_KILLPOINTS
+// Test builds: VESSELD_TEST_HANDLER_DELAY=<command>:<seconds> holds every message
+// with that command number for that long before it is handled, as a handler stuck
+// on a slow disk would.
+void delayForTests(const Value& body) {
+    struct Delay {
+        uint64_t command = 0;
+        unsigned seconds = 0;
+    };
+    static const Delay delay = [] {
+        Delay d;
+        const char* setting = std::getenv("VESSELD_TEST_HANDLER_DELAY");
+        if (!setting) return d;
+        char* end = nullptr;
+        d.command = std::strtoull(setting, &end, 10);
+        if (end && *end == ':') d.seconds = static_cast<unsigned>(std::strtoul(end + 1, nullptr, 10));
+        return d;
+    }();
+    if (delay.seconds == 0) return;
+    const Value* command = body.find("Command");
+    const uint64_t number = command && command->uint64Value() ? *command->uint64Value() : 0;
+    if (number == delay.command) std::this_thread::sleep_for(std::chrono::seconds(delay.seconds));
+}
+#endif
+
+}  // namespace
 
 std::unique_ptr<VSLService> VSLService::start(const std::shared_ptr<WorkQueue>& listenerQueue, std::string* error) {
     IpcServerOptions options;
     options.path = defaultIpcServicePath();
     options.connectionQueue = listenerQueue;
+    options.maxConnectionsPerUid = kVSLConnectionsPerUser;
+    options.maxConnectionsPrivileged = kVSLConnectionsPrivileged;
+    options.idleConnectionTimeout = kVSLIdleConnectionTimeout;
     options.onConnection = [](std::shared_ptr<IpcPeer>) {};
     options.onMessage = [](std::shared_ptr<IpcPeer> peer, IpcMessage message) {
+#ifdef VESSEL_KILLPOINTS
+        delayForTests(message.body);
+#endif
         VSLPeerCredentials credentials;
         credentials.pid = peer->pid();
         credentials.uid = peer->uid();
@@ -34,8 +74,6 @@ std::unique_ptr<VSLService> VSLService::start(const std::shared_ptr<WorkQueue>& 
     return service;
 }
 
-void VSLService::stop() {
-    if (server_) server_->stop();
-}
+bool VSLService::stop(std::chrono::milliseconds grace) { return server_ ? server_->stop(grace) : true; }
 
 }  // namespace vsl

@@ -1,6 +1,7 @@
 // vesselctl: talks to vesseld.
 //   vesselctl [--root DIR | --socket PATH] [--json | --plist] [--timeout SECONDS] COMMAND [key=value ...]
 // COMMAND is a command name (see `vesselctl help`) or its number.
+#include <cerrno>
 #include <cstdio>
 #include <cstdlib>
 #include <string>
@@ -25,7 +26,8 @@ int usage(FILE* out) {
                  "key:type=value names a type: str u64 i64 bool uuid null plist(=@FILE) u64s strs uuids.\n"
                  "--json prints the reply as JSON, --plist as a binary property list.\n"
                  "The root defaults to $VESSELD_ROOT or /. Exit status: 0 when ReplyError is 1,\n"
-                 "1 for any other result, 2 for a usage error, 3 when the daemon cannot be reached.\n"
+                 "1 for any other result, 2 for a usage error, 3 when the daemon cannot be reached,\n"
+                 "refuses the connection or does not answer.\n"
                  "\n"
                  "commands:\n");
     for (uint64_t i = 0; i < kVSLProtocolCommandCount; i++) std::fprintf(out, "  %2llu  %s\n", (unsigned long long)i, commandName(i));
@@ -104,23 +106,45 @@ int main(int argc, char** argv) {
     if (socketPath.empty()) socketPath = VSLConnection::socketPathForSystemRoot(root);
     auto connection = VSLConnection::connect(socketPath, &error);
     if (!connection) {
-        std::fprintf(stderr,
-                     "vesselctl: cannot reach vesseld at %s: %s\n"
-                     "  is it running? start one on a scratch root with: vesseld --root DIR --init\n",
-                     socketPath.c_str(), error.c_str());
+        if (errno == ENOENT || errno == ECONNREFUSED) {
+            std::fprintf(stderr,
+                         "vesselctl: vesseld is not running (nothing answers at %s)\n"
+                         "  start one on a scratch root with: vesseld --root DIR --init\n",
+                         socketPath.c_str());
+        } else {
+            std::fprintf(stderr, "vesselctl: cannot reach vesseld: %s\n", error.c_str());
+        }
         return 3;
     }
     VSLReply reply = connection->sendRequest(Value::dictionary(std::move(request)),
                                              std::chrono::milliseconds(timeoutSeconds * 1000));
     if (!reply.ok()) {
-        std::fprintf(stderr, "vesselctl: %s: %s\n", statusName(reply.status), reply.error.c_str());
-        if (reply.status == VSLConnectionStatus::Closed)
+        switch (reply.status) {
+        case VSLConnectionStatus::Refused:
             std::fprintf(stderr,
-                         "  vesseld stopped while handling the request; see vesseld.log in\n"
-                         "  %s/private/var/root/Library/Logs/Vesselry. An unusable code-signing database\n"
-                         "  (containers.sqlite3 in private/var/root/Library/Vesselry) is reported there:\n"
-                         "  move it aside and restart vesseld; installers register their information again.\n",
-                         root == "/" ? "" : root.c_str());
+                         "vesselctl: vesseld refused the connection: %s\n"
+                         "  this user holds as many connections to vesseld as it may; close some and retry\n",
+                         reply.error.c_str());
+            break;
+        case VSLConnectionStatus::Closed:
+            // Whether anything still answers tells a stopped daemon from a dropped connection.
+            if (VSLConnection::connect(socketPath)) {
+                std::fprintf(stderr, "vesselctl: vesseld closed the connection before answering (%s)\n",
+                             reply.error.c_str());
+            } else {
+                std::fprintf(stderr,
+                             "vesselctl: vesseld stopped before answering; vesseld.log in\n"
+                             "  %s/private/var/root/Library/Logs/Vesselry says why\n",
+                             root == "/" ? "" : root.c_str());
+            }
+            break;
+        case VSLConnectionStatus::Timeout:
+            std::fprintf(stderr, "vesselctl: no reply from vesseld within %ld s\n", timeoutSeconds);
+            break;
+        default:
+            std::fprintf(stderr, "vesselctl: %s: %s\n", statusName(reply.status), reply.error.c_str());
+            break;
+        }
         return 3;
     }
     if (asPlist) {

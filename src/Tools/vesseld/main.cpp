@@ -33,7 +33,16 @@ void usage() {
     std::fprintf(stderr, "usage: vesseld [--root DIR] [--init] [--debug]\n");
 }
 
-// Signals are taken by one thread so that no handler runs inside daemon code.
+// Handlers still running when a stop is asked for get this long; then the process
+// exits under them. Open transactions get kTransactionGrace more. Whatever happens,
+// kStopLimit after the signal the process is gone.
+constexpr auto kHandlerGrace = std::chrono::seconds(2);
+constexpr auto kTransactionGrace = std::chrono::seconds(1);
+constexpr auto kStopLimit = std::chrono::seconds(4);
+
+// Signals are taken by one thread so that no handler runs inside daemon code. The
+// first SIGTERM or SIGINT starts a clean stop; a second one, or the stop limit,
+// ends the process at once.
 void startSignalThread() {
     sigset_t set;
     sigemptyset(&set);
@@ -44,6 +53,12 @@ void startSignalThread() {
         int sig = 0;
         sigwait(&set, &sig);
         stopMainLoop();
+        const auto limit = std::chrono::duration_cast<std::chrono::seconds>(kStopLimit).count();
+        const timespec wait{static_cast<time_t>(limit), 0};
+        const bool again = sigtimedwait(&set, nullptr, &wait) > 0;
+        LogWrite(kLogLevelNotice, "main", again ? "Stopping at once on a second signal"
+                                                : "Stopping at once: the clean stop did not end in time");
+        ::_exit(0);
     }).detach();
 }
 
@@ -85,6 +100,8 @@ int main(int argc, char** argv) {
         }
     }
     reloadDeviceFacts();
+    // Asked-for verbosity wins, whichever asked: --debug, VESSELD_DEBUG or device.plist.
+    if (auto level = deviceFacts().logLevel; level && *level > logVerbosity()) setLogVerbosity(*level);
     startSignalThread();
 
     auto listenerQueue = WorkQueue::serial("com.tarrow.vesseld.listener");
@@ -103,9 +120,14 @@ int main(int argc, char** argv) {
 
     runMainLoop();
 
-    service->stop();
-    if (!waitForNoTransactions(std::chrono::seconds(3)))
+    // A handler blocked on a slow disk or a FIFO must not keep the daemon alive: past
+    // the grace periods, exit under whatever still runs rather than tear it down.
+    const bool handlersDone = service->stop(kHandlerGrace);
+    if (!handlersDone) LogWrite(kLogLevelNotice, "main", "Stopping with request handlers still running");
+    const bool transactionsDone = waitForNoTransactions(kTransactionGrace);
+    if (!transactionsDone)
         LogWrite(kLogLevelNotice, "main", "Stopping with %llu transactions open", (unsigned long long)openTransactionCount());
     closeLogFile();
+    if (!handlersDone || !transactionsDone) ::_exit(0);
     return 0;
 }
