@@ -226,3 +226,68 @@ TEST(GroupContainers, ClientsAskingAtOnceForOwnersThatShareGroupsGetOneContainer
     EXPECT_TRUE(stringsOf(none.reply, "ReplyGroupContainerDict").empty());
     EXPECT_EQ(0, daemon.stop());
 }
+
+TEST(SystemContainers, WellKnownNamesAndTheCallersEntitledListDecide) {
+    DaemonProcess daemon;
+    std::string installer = daemon.addClient("installer", "com.example.installer", dict({{kAllowed, Value::boolean(true)}}));
+    std::string stranger = daemon.addClient("stranger", "com.example.stranger", Value::dictionary({}));
+    ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
+    const char* const kSystemGroups = "com.tarrow.security.system-groups";
+    registerOwner(daemon, installer, "com.example.installer",
+                  dict({{kAllowed, Value::boolean(true)},
+                        {kSystemGroups, strings({"systemgroup.com.tarrow.telephony", "systemgroup.com.example.own",
+                                                 "com.example.unprefixed"})}}));
+    const std::string systemGroups = daemon.at("private/var/containers/Shared/SystemGroup");
+
+    // Command 15: a well-known system container of another identifier needs no entitlement.
+    auto wellKnown = daemon.run(stranger, {"system-container", "Identifier=com.tarrow.settingsd"});
+    ASSERT_EQ(1u, wellKnown.code()) << wellKnown.err;
+    EXPECT_EQ(daemon.at("private/var/containers/Data/System/com.tarrow.settingsd"), wellKnown.string("ReplyPath"));
+    EXPECT_TRUE(isDirectory(wellKnown.string("ReplyPath")));
+    EXPECT_EQ(55u, daemon.run(stranger, {"system-container", "Identifier=com.example.other"}).code());
+    EXPECT_EQ(55u, daemon.run(stranger, {"system-container"}).code()) << "its own needs the system-container entitlement";
+
+    // Command 16: the owner's system groups, prefix rule applied.
+    auto own = daemon.run(installer, {"system-groups"});
+    ASSERT_EQ(1u, own.code()) << own.err;
+    auto ownPaths = stringsOf(own.reply, "ReplyGroupContainerDict");
+    EXPECT_EQ(2u, ownPaths.size());
+    EXPECT_EQ(systemGroups + "/systemgroup.com.tarrow.telephony", ownPaths["systemgroup.com.tarrow.telephony"]);
+    EXPECT_TRUE(isDirectory(ownPaths["systemgroup.com.example.own"]));
+    EXPECT_FALSE(own.reply.find("ReplySandboxTokenDict"));
+    removeTree(ownPaths["systemgroup.com.tarrow.telephony"]);
+    ASSERT_EQ(0, daemon.stop());
+    ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
+
+    // Command 17, an entitled group: only through the owner's groups, never by its
+    // well-known name, so an owner that does not name it finds nothing.
+    auto viaOther = daemon.run(installer, {"system-group", "systemgroup.com.tarrow.telephony",
+                                           "Identifier=com.example.other"});
+    EXPECT_EQ(21u, viaOther.code()) << viaOther.err;
+    EXPECT_FALSE(isDirectory(systemGroups + "/systemgroup.com.tarrow.telephony"));
+    auto viaOwn = daemon.run(installer, {"system-group", "systemgroup.com.tarrow.telephony"});
+    ASSERT_EQ(1u, viaOwn.code()) << viaOwn.err;
+    EXPECT_EQ(systemGroups + "/systemgroup.com.tarrow.telephony", viaOwn.string("ReplyPath"));
+    EXPECT_TRUE(isDirectory(viaOwn.string("ReplyPath")));
+
+    // A well-known group outside the caller's list: by its well-known name.
+    auto font = daemon.run(stranger, {"system-group", "systemgroup.com.tarrow.fontregistry"});
+    ASSERT_EQ(1u, font.code()) << font.err;
+    EXPECT_EQ(systemGroups + "/systemgroup.com.tarrow.fontregistry", font.string("ReplyPath"));
+    EXPECT_TRUE(isDirectory(font.string("ReplyPath")));
+
+    // Anything else is refused; one group's refusal is silent.
+    const size_t before = entriesIn(systemGroups);
+    EXPECT_EQ(55u, daemon.run(stranger, {"system-group", "systemgroup.com.example.own"}).code());
+    EXPECT_EQ(55u, daemon.run(stranger, {"system-group", "systemgroup.com.tarrow.bellwort"}).code());
+    EXPECT_EQ(55u, daemon.run(stranger, {"systemGroupContainerPath", "GroupIdentifier:u64=3"}).code())
+        << "a group that is not a string is no group";
+    EXPECT_EQ(before, entriesIn(systemGroups));
+    ASSERT_EQ(0, daemon.stop());
+    std::string logs = readFile(daemon.at("private/var/root/Library/Logs/Vesselry/vesseld.log")) +
+                       readFile(daemon.at("vesseld.stderr"));
+    EXPECT_NE(std::string::npos,
+              logs.find("com.example.stranger is not entitled for system group identifier: systemgroup.com.example.own"))
+        << logs;
+    EXPECT_EQ(std::string::npos, logs.find("bellwort")) << logs;
+}
