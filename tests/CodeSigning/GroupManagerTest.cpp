@@ -19,14 +19,6 @@ using namespace vsl::test;
 
 namespace {
 
-Value strings(std::initializer_list<const char*> items) {
-    Array a;
-    for (const char* s : items) a.push_back(Value::string(s));
-    return Value::array(std::move(a));
-}
-
-Value appGroups(Value groups) { return infoWithEntitlements(dict({{kVSLApplicationGroupsEntitlement, groups}})); }
-
 std::set<std::string> asSet(const std::optional<std::vector<std::string>>& list) {
     return list ? std::set<std::string>(list->begin(), list->end()) : std::set<std::string>{"<none>"};
 }

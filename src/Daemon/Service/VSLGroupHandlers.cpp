@@ -6,7 +6,6 @@
 #include "Daemon/CodeSigning/VSLGroupManager.h"
 #include "Daemon/CodeSigning/VSLWhitelist.h"
 #include "Daemon/Core/VSLErrorCodes.h"
-#include "Daemon/Core/VSLUserIdentityCache.h"
 #include "Daemon/Service/VSLRequestDecoding.h"
 #include "Daemon/Storage/VSLMetadata.h"
 #include "Platform/Log.h"
@@ -42,24 +41,17 @@ VSLUserIdentityRef groupOwnerUserIdentity(VSLClientConnection& connection, const
     auto mapping = VSLCodeSigningMapping::sharedInstance();
     if (auto parent = mapping ? mapping->parentIdentifierForChildIdentifier(owner) : std::nullopt)
         bundleIdentifier = *parent;
-    auto identities = VSLUserIdentitySharedCache::sharedInstance()->userIdentitiesForBundleIdentifier(bundleIdentifier);
+    size_t installed = 0;
     std::string listed;
-    for (const auto& u : identities) listed += (listed.empty() ? "" : ", ") + u->shortDescription();
+    auto chosen = chooseInstalledUserIdentity(connection, bundleIdentifier, &installed, &listed);
     osLog(LogCategory::Ipc, OSLogLevel::Debug,
           "Chose bundleIdentifier: %@ for group container lookup, userIdentities: %@ for identifier: %@",
           bundleIdentifier, listed, owner);
-    if (identities.size() == 1) return *identities.begin();
-    if (identities.size() >= 2) {
-        for (const auto& u : identities)
-            if (u->isEqual(*own)) return own;
-        osLog(LogCategory::Ipc, OSLogLevel::Fault, "Ambiguous user identity from [%@]. Expected one of [%@], got %@",
-              connection.clientIdentity(), listed, own);
-        *code = kVSLErrorWrongPersona;
-        return nullptr;
-    }
+    if (chosen) return chosen;
+    *code = kVSLErrorWrongPersona;
+    if (installed >= 2) return nullptr;  // ambiguous, logged as such
     LogWrite(kLogLevelError, kGroupsLogName, "%@ trying to look up persona for group owner %@",
              connection.clientIdentity(), owner);
-    *code = kVSLErrorWrongPersona;
     return nullptr;
 }
 
