@@ -10,16 +10,6 @@ using namespace vsl::test;
 
 namespace {
 
-Value strings(std::initializer_list<const char*> items) {
-    Array a;
-    for (const char* s : items) a.push_back(Value::string(s));
-    return Value::array(std::move(a));
-}
-
-Value appGroups(Value groups) {
-    return infoWithEntitlements(dict({{kVSLApplicationGroupsEntitlement, groups}}));
-}
-
 bool drain(const std::shared_ptr<VSLCommandQueue>& queue, uint64_t* code = nullptr) {
     uint64_t c = kVSLSuccess;
     bool ok = queue->executeAllUntilExhaustedOrError(&c);

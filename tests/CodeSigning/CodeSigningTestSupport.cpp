@@ -85,6 +85,14 @@ Value infoWithEntitlements(const Value& entitlements, Dictionary extra) {
     return Value::dictionary(std::move(extra));
 }
 
+Value strings(std::initializer_list<const char*> items) {
+    Array a;
+    for (const char* s : items) a.push_back(Value::string(s));
+    return Value::array(std::move(a));
+}
+
+Value appGroups(Value groups) { return infoWithEntitlements(dict({{kVSLApplicationGroupsEntitlement, groups}})); }
+
 VSLMetadataRef makeContainer(const VSLUserIdentityRef& user, VSLContainerClass containerClass,
                              const std::string& identifier, bool transient, std::optional<Value> info) {
     auto classDirectory =

@@ -53,6 +53,9 @@ protected:
 
 // { "com.tarrow.Vesselry.Entitlements": entitlements } plus `extra` keys.
 Value infoWithEntitlements(const Value& entitlements, Dictionary extra = {});
+// An array of strings; info whose entitlements name these application groups.
+Value strings(std::initializer_list<const char*> items);
+Value appGroups(Value groups);
 
 // A container directory named by a fresh UUID in its class directory, with its
 // metadata written and the record added to the shared container cache.

@@ -24,6 +24,7 @@
 #include "Daemon/CodeSigning/VSLCodeSigningEntry.h"
 #include "Daemon/CodeSigning/VSLSQLiteDB.h"
 #include "Daemon/Concurrency/VSLCommandQueue.h"
+#include "Daemon/Core/VSLContainerClass.h"
 #include "Daemon/Core/VSLError.h"
 #include "Daemon/Core/VSLUserIdentity.h"
 #include "Platform/Value.h"
@@ -46,9 +47,6 @@ extern const char* const kVSLOptionPlaceholder;         // "com.tarrow.Vesselry.
 extern const char* const kVSLOptionAdvanceCopy;         // "com.tarrow.Vesselry.AdvanceCopy"
 // The code-signing information a bundle container's metadata caches.
 extern const char* const kVSLCachedCodeSigningInfoKey;  // "com.tarrow.Stowage.CachedCodeSigningInfo"
-
-// Group types: application groups (class 7) and system groups (class 13).
-enum VSLGroupType : int64_t { kVSLGroupTypeApplication = 0, kVSLGroupTypeSystem = 1 };
 
 // Group identifier -> number of stored identifiers that name it.
 using VSLCountedSet = std::unordered_map<std::string, uint64_t>;

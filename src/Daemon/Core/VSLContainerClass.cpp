@@ -27,18 +27,21 @@ constexpr const char* kGroupExtension = "com.tarrow.sandbox.application-group";
 using F = VSLContainerFamily;
 using O = VSLContainerOwner;
 using P = VSLSkeletonProtection;
+using G = VSLGroupScope;
+constexpr VSLGroupType kApp = kVSLGroupTypeApplication;
 
 constexpr VSLContainerClassTraits bound(const char* name) {
-    return {name, nullptr, F::Invalid, false, false, true, O::None, O::None, 0, kNoSkeleton, P::None, 0, nullptr};
+    return {name, nullptr, F::Invalid, false, false, true, O::None, O::None, 0, kNoSkeleton, P::None, 0, nullptr,
+            G::None, kApp};
 }
 constexpr VSLContainerClassTraits bundle(const char* name, const char* shortName) {
     return {name, shortName, F::Bundle, false, false, false, O::Installer, O::Installer, 0755, kNoSkeleton, P::None,
-            0,    nullptr};
+            0,    nullptr,   G::None, kApp};
 }
 constexpr VSLContainerClassTraits data(const char* name, const char* shortName, bool childData,
                                        std::span<const char* const> skeleton, const char* extension) {
     return {name, shortName, F::Data, false, childData, true, O::User, O::User, 0755, skeleton, P::Container,
-            1,    extension};
+            1,    extension, G::None, kApp};
 }
 
 constexpr VSLContainerClassTraits kClasses[] = {
@@ -50,15 +53,15 @@ constexpr VSLContainerClassTraits kClasses[] = {
     bundle("Bundle/VPNPlugin", "vpn"),
     data("Data/VPNPlugin", "vpnData", true, kDataSkeleton, kContainerExtension),
     {"Shared/AppGroup", "appGroup", F::Group, true, false, true, O::User, O::User, 0755, kGroupSkeleton, P::Container,
-     2, kGroupExtension},
+     2, kGroupExtension, G::EachUser, kVSLGroupTypeApplication},
     bundle("Bundle/Framework", "framework"),
     data("Data/IPCService", "ipcService", false, kDataSkeleton, nullptr),
     data("Data/InternalDaemon", "daemon", false, kDataSkeleton, kContainerExtension),
     data("Data/TempDir", "tempDir", false, kTempDirSkeleton, nullptr),
     {"Data/System", "systemData", F::System, false, false, false, O::SystemContainer, O::Nobody, 0,
-     kSystemDataSkeleton, P::None, 4, nullptr},
+     kSystemDataSkeleton, P::None, 4, nullptr, G::None, kApp},
     {"Shared/SystemGroup", "systemGroup", F::System, true, false, false, O::SystemContainer, O::Nobody, 0,
-     kSystemGroupSkeleton, P::None, 8, nullptr},
+     kSystemGroupSkeleton, P::None, 8, nullptr, G::Device, kVSLGroupTypeSystem},
     bound("MAX"),
 };
 static_assert(std::size(kClasses) == kVSLClassMax + 1);
@@ -87,6 +90,12 @@ bool isPerUserContainerClass(VSLContainerClass c) {
 bool isGroupContainerClass(VSLContainerClass c) { return containerClassTraits(c).group; }
 
 bool isChildDataContainerClass(VSLContainerClass c) { return containerClassTraits(c).childData; }
+
+VSLContainerClass groupContainerClassForType(VSLGroupType type) {
+    for (VSLContainerClass c = 1; c < kVSLClassMax; c++)
+        if (kClasses[c].groupScope != G::None && kClasses[c].groupType == type) return c;
+    return kVSLClassAppGroup;
+}
 
 const char* containerClassDirectoryName(VSLContainerClass c) { return containerClassTraits(c).directoryName; }
 

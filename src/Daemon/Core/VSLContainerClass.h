@@ -45,6 +45,15 @@ enum class VSLContainerOwner : uint8_t {
     Nobody,           // 4294967294: system-container subdirectories
 };
 
+// Group classes: which entitlement names their groups (application groups, or system
+// groups with the "systemgroup." prefix), and whose containers a group has.
+enum VSLGroupType : int64_t { kVSLGroupTypeApplication = 0, kVSLGroupTypeSystem = 1 };
+enum class VSLGroupScope : uint8_t {
+    None,      // not a group class
+    EachUser,  // one container per user: reconciled for every user that has a home
+    Device,    // one per device: reconciled for the default user only
+};
+
 // Protection class of the skeleton: none (0), or the container's own (its info
 // value, else what its entitlements ask for), names excluded from user data aside.
 enum class VSLSkeletonProtection : uint8_t { None, Container };
@@ -63,6 +72,8 @@ struct VSLContainerClassTraits {
     VSLSkeletonProtection skeletonProtection;
     uint64_t sandboxItemType;           // kernel sandbox item kept for the class; 0: none
     const char* sandboxExtensionClass;  // token for sandboxed clients; none: no token
+    VSLGroupScope groupScope;
+    VSLGroupType groupType;  // the entitlement asked for a group owner's groups (application for the rest)
 };
 
 // Any number: past the bounds a row with no names and the invalid family.
@@ -74,6 +85,8 @@ bool isSystemContainerClass(VSLContainerClass c);  // 12, 13
 bool isPerUserContainerClass(VSLContainerClass c);  // 2, 4, 6, 7, 9, 10, 11
 bool isGroupContainerClass(VSLContainerClass c);  // 7, 13
 bool isChildDataContainerClass(VSLContainerClass c);  // 4, 6: identifier may be a plug-in's
+// The group class whose groups the type counts: 13 for system groups, else 7.
+VSLContainerClass groupContainerClassForType(VSLGroupType type);
 
 // "Data/Application" etc.; "Undefined" / "MAX" for the bounds; nullptr past 14.
 const char* containerClassDirectoryName(VSLContainerClass c);

@@ -82,6 +82,13 @@ public:
                                bool onlyMissing = false);
     int32_t _dataProtectionClassForContainerMetadata(const VSLMetadata& metadata);
 
+    // Every group the owner's entitlements name for the class (7 or 13), created when
+    // missing, under one global write lock (VSLClientConnectionGroups.cpp). A group
+    // that cannot be made is logged and left out without failing the call.
+    std::optional<std::map<std::string, VSLMetadataRef>> groupContainersForOwnerIdentifier(
+        const std::string& ownerIdentifier, const VSLUserIdentityRef& userIdentity,
+        VSLContainerClass groupContainerClass, uint64_t* code);
+
     // Info values, metadata, skeleton, directory name and disk usage of one existing
     // container (VSLClientConnectionInfo.cpp). Reads take its identifier read lock,
     // writes its write lock; the renaming takes the global write lock.
@@ -140,5 +147,8 @@ private:
 // Adds a sandbox token for the container to the reply when the rules allow one.
 void issueSandboxExtension(VSLReply& reply, const char* replyKey, const VSLMetadata& metadata,
                            const VSLClientIdentityRef& client);
+// The token itself; none where the rules give none.
+std::optional<std::string> sandboxExtensionForContainer(const VSLMetadata& metadata,
+                                                        const VSLClientIdentityRef& client);
 
 }  // namespace vsl

@@ -9,6 +9,7 @@
 #include "Daemon/Concurrency/VSLTestLocks.h"
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Daemon/Core/VSLExceptionGuard.h"
+#include "Daemon/Core/VSLInjectedFaults.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Service/VSLContainerSkeleton.h"
 #include "Daemon/Service/VSLReply.h"
@@ -250,6 +251,8 @@ VSLMetadataRef VSLClientConnection::createContainer(const VSLContainerIdentityRe
                                                                             identity->identifier(), c, &idCode);
     if (!concrete) return cleanUp(createVSLError(kCreateFn, __LINE__, idCode, nullptr, false));
     auto metadata = VSLMetadata::initWithContainerIdentity(concrete, std::nullopt, staging, std::nullopt);
+    if (creationFailureInjectedFor(identity->identifier()))
+        return cleanUp(VSL_POSIX_ERROR(EIO, "Injected failure creating %@", identity->identifier()));
     if (!metadata->writeMetadataToDiskWithError(&underlying)) return cleanUp(underlying);
     if (isSystemContainerClass(c) && !fm.setTopLevelSystemContainerACLAtURL(staging, &underlying))
         return cleanUp(underlying);
@@ -315,7 +318,12 @@ bool VSLClientConnection::deleteContainerWithContainerIdentity(const VSLContaine
 
 void issueSandboxExtension(VSLReply& reply, const char* replyKey, const VSLMetadata& metadata,
                            const VSLClientIdentityRef& client) {
-    if (!client || !client->sandboxed()) return;
+    if (auto token = sandboxExtensionForContainer(metadata, client)) reply.set(replyKey, Value::string(*token));
+}
+
+std::optional<std::string> sandboxExtensionForContainer(const VSLMetadata& metadata,
+                                                        const VSLClientIdentityRef& client) {
+    if (!client || !client->sandboxed()) return std::nullopt;
     VSLContainerClass c = metadata.containerClass();
     const char* extensionClass = containerClassTraits(c).sandboxExtensionClass;
     bool enterprise = metadata.userIdentity() && metadata.userIdentity()->isEnterprise();
@@ -323,7 +331,7 @@ void issueSandboxExtension(VSLReply& reply, const char* replyKey, const VSLMetad
         osLog(LogCategory::Sandbox, OSLogLevel::Info,
               "%@ is sandboxed and container (type: %llu) is enterprise: %d. NOT issuing token for path: %s",
               client->bundleIdentifier(), c, enterprise, metadata.url());
-        return;
+        return std::nullopt;
     }
     osLog(LogCategory::Sandbox, OSLogLevel::Default,
           "%@ is sandboxed and container (type: %llu) is enterprise: %d. Issuing token for path: %s",
@@ -332,9 +340,9 @@ void issueSandboxExtension(VSLReply& reply, const char* replyKey, const VSLMetad
     if (!token) {
         LogWrite(kLogLevelError, "issueSandboxExtension", "sandbox_extension_issue_file failed for %@ at path %s: %d",
                  client->bundleIdentifier(), metadata.url(), errno);
-        return;
+        return std::nullopt;
     }
-    reply.set(replyKey, Value::string(*token));
+    return token;
 }
 
 }  // namespace vsl

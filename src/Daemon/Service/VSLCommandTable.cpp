@@ -5,6 +5,7 @@
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Daemon/Service/VSLContainerHandlers.h"
 #include "Daemon/Service/VSLEntitlements.h"
+#include "Daemon/Service/VSLGroupHandlers.h"
 #include "Daemon/Service/VSLInfoHandlers.h"
 #include "Daemon/Service/VSLReplaceHandler.h"
 #include "Daemon/Service/VSLRequestDecoding.h"
@@ -34,11 +35,11 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {10, handleDeleteContainer, A, 0x1},
     {11, nullptr, kVSLEntitlementWipeContainer, 0x1},
     {12, nullptr, kVSLEntitlementDeleteContainerContent, 0x1},
-    {13, nullptr, A, 0x10101},
-    {14, nullptr, A, 0x10001},
-    {15, nullptr, A, 0x10101},
-    {16, nullptr, A, 0x10101},
-    {17, nullptr, A, 0x10101},
+    {13, handleCreateOrLookupGroupContainers, A, 0x10101},
+    {14, handleGroupContainerIdentifiers, A, 0x10001},
+    {15, handleSystemContainerPath, A, 0x10101},
+    {16, handleSystemGroupContainers, A, 0x10101},
+    {17, handleSystemGroupContainerPath, A, 0x10101},
     {18, processCodeSigningInfoCommand, A, 0x1},
     {19, getCodeSigningInfoCommand, A, 0x1},
     {20, invalidateCodeSigningInfoCommand, A, 0x1},

@@ -93,24 +93,33 @@ VSLUserIdentityRef userIdentityForContainerIdentifier(VSLClientConnection& conne
         if (auto parent = mapping ? mapping->parentIdentifierForChildIdentifier(identifier) : std::nullopt)
             bundleIdentifier = *parent;
     }
-    auto cache = VSLUserIdentitySharedCache::sharedInstance();
-    auto identities = cache->userIdentitiesForBundleIdentifier(bundleIdentifier);
+    size_t installed = 0;
     std::string listed;
-    for (const auto& u : identities) listed += (listed.empty() ? "" : ", ") + u->shortDescription();
+    auto chosen = chooseInstalledUserIdentity(connection, bundleIdentifier, &installed, &listed);
     osLog(LogCategory::Ipc, OSLogLevel::Debug,
           "Chose bundleIdentifier: %@, userIdentities: %@ for identifier: %@, class: %llu", bundleIdentifier, listed,
           identifier, containerClass);
-    if (identities.size() == 1) return *identities.begin();
-    if (identities.size() >= 2) {
-        for (const auto& u : identities)
-            if (u->isEqual(*own)) return own;
-        osLog(LogCategory::Ipc, OSLogLevel::Fault, "Ambiguous user identity from [%@]. Expected one of [%@], got %@",
-              connection.clientIdentity(), listed, own);
-        return own;
-    }
+    if (chosen) return chosen;
+    if (installed >= 2) return own;  // ambiguous: the client's own, after all
     LogWrite(kLogLevelError, "userIdentityForContainerIdentifier", "%@ trying to look up persona for %llu:%@",
              connection.clientIdentity(), containerClass, identifier);
     return own;
+}
+
+VSLUserIdentityRef chooseInstalledUserIdentity(VSLClientConnection& connection, const std::string& bundleIdentifier,
+                                               size_t* installed, std::string* listed) {
+    VSLUserIdentityRef own = clientUserIdentity(connection);
+    auto identities = VSLUserIdentitySharedCache::sharedInstance()->userIdentitiesForBundleIdentifier(bundleIdentifier);
+    *installed = identities.size();
+    listed->clear();
+    for (const auto& u : identities) *listed += (listed->empty() ? "" : ", ") + u->shortDescription();
+    if (identities.size() == 1) return *identities.begin();
+    if (identities.empty()) return nullptr;
+    for (const auto& u : identities)
+        if (own && u->isEqual(*own)) return own;
+    osLog(LogCategory::Ipc, OSLogLevel::Fault, "Ambiguous user identity from [%@]. Expected one of [%@], got %@",
+          connection.clientIdentity(), *listed, own);
+    return nullptr;
 }
 
 VSLConcreteContainerIdentityRef concreteIdentityFromRequest(const Value& request, const char* identifierKey,

@@ -37,6 +37,11 @@ VSLUserIdentityRef userIdentityForPersonaUniqueString(const std::optional<std::s
 VSLUserIdentityRef userIdentityForContainerIdentifier(VSLClientConnection& connection, const std::string& identifier,
                                                       VSLContainerClass containerClass, uint64_t* code);
 
+// Among the personas `bundleIdentifier` is installed in: the only one, or the
+// client's own when it is one of several. None when there is none (`*installed` is
+// 0) or when several exclude the client's (logged as ambiguous). `listed` names them.
+VSLUserIdentityRef chooseInstalledUserIdentity(VSLClientConnection& connection, const std::string& bundleIdentifier,
+                                               size_t* installed, std::string* listed);
 // Command 32.
 void listAccessiblePersonas(const Value& request, const VSLReplyRef& reply, const VSLClientConnectionRef& connection,
                             uint64_t* code);

@@ -25,6 +25,7 @@ Dictionary command(uint64_t number) { return {{"Command", Value::uint64(number)}
 }  // namespace
 
 std::optional<Dictionary> subcommandRequest(int argc, char** argv, int* index, std::string* error) {
+    if (auto group = groupSubcommandRequest(argc, argv, index, error)) return group;
     const int i = *index;
     const std::string word = argv[i];
     auto need = [&](int words, const char* usage) {

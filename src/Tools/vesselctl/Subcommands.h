@@ -9,6 +9,8 @@
 //   du                             diskUsage
 //   test-lock N on|off             setTestLock
 //   retry-test N                   retryTest
+//   groups, group-ids, system-container, system-groups, system-group GROUP
+//                                  commands 13 to 17 (GroupSubcommands.cpp)
 #pragma once
 
 #include <optional>
@@ -21,3 +23,7 @@
 std::optional<vsl::Dictionary> subcommandRequest(int argc, char** argv, int* index, std::string* error);
 
 extern const char* const kSubcommandUsage;
+
+// The group subcommands alone.
+std::optional<vsl::Dictionary> groupSubcommandRequest(int argc, char** argv, int* index, std::string* error);
+extern const char* const kGroupSubcommandUsage;
