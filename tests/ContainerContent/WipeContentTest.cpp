@@ -102,8 +102,9 @@ TEST_F(WipeContent, AWipeListLetsAClientWipeItsPlugInContainerAndNothingElse) {
     // No identifier: 18.
     EXPECT_EQ(18u, daemon.run(wiper, {"wipeContainer"}).code());
 
-    auto r = daemon.run(wiper, {"--json", "wipe", kWidget});
-    ASSERT_EQ(0, r.exitCode) << r.out << r.err;
+    std::string out, err;
+    ASSERT_EQ(0, runProgram({wiper, "--root", daemon.root(), "--json", "wipe", kWidget}, &out, &err)) << out << err;
+    EXPECT_NE(std::string::npos, out.find("\"ReplyError\":1")) << out;
 
     Container after = lookUp(kWidget, 4);
     EXPECT_EQ(widget.uuid, after.uuid);
