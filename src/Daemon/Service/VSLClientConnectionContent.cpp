@@ -314,7 +314,11 @@ bool VSLClientConnection::deleteUserManagedAssetWithContainerIdentity(const VSLC
                                    *realAssets);
             return false;
         }
-        if (!ops.removeItemBelowDirectory(*realAssets, realTarget->substr(realAssets->size() + 1), &underlying)) {
+        // Every step below the container is taken without following a link, so a
+        // directory swapped for one after the check ends the removal.
+        const std::string below = std::string(kAssetsParent) + "/" + *found->userManagedAssetsDirName() + "/" +
+                                  realTarget->substr(realAssets->size() + 1);
+        if (!ops.removeItemBelowDirectory(*realContainer, below, &underlying)) {
             error = createVSLError(kDeleteAssetFn, __LINE__, kVSLErrorMoveToDeathRow, underlying, true,
                                    "Failed to remove asset at %@", *realTarget);
             return false;
