@@ -65,6 +65,18 @@ bool isDirectoryBelow(const std::string& parent, const std::string& name) {
     return durable::openDirectoryNoFollow(joinPath(parent, name), fd.out()) == 0;
 }
 
+// An application's data container, for its assets directory.
+VSLMetadataRef findDataContainer(const char* function, const VSLContainerIdentityRef& identity, VSLErrorRef* error) {
+    VSLErrorRef underlying;
+    auto found =
+        VSLContainerCache::sharedInstance()->containerForContainerIdentity(identity, false, true, &underlying);
+    if (!found)
+        *error = createVSLError(function, __LINE__, kVSLErrorInvalidObject, underlying, true,
+                                "Failed to create app data container for user managed assets path for %@: %@",
+                                identity, underlying);
+    return found;
+}
+
 }  // namespace
 
 bool VSLClientConnection::deleteDataContainerContentWithContainerIdentity(const VSLContainerIdentityRef& identity,
@@ -217,15 +229,8 @@ std::optional<std::string> VSLClientConnection::userManagedAssetsPathWithContain
                                    clientBundleIdentifier(), identity->identifier());
             return false;
         }
-        VSLErrorRef underlying;
-        auto found = VSLContainerCache::sharedInstance()->containerForContainerIdentity(identity, false, true,
-                                                                                       &underlying);
-        if (!found) {
-            error = createVSLError(kAssetsPathFn, __LINE__, kVSLErrorInvalidObject, underlying, true,
-                                   "Failed to create app data container for user managed assets path for %@: %@",
-                                   identity, underlying);
-            return false;
-        }
+        auto found = findDataContainer(kAssetsPathFn, identity, &error);
+        if (!found) return false;
         if (found->url().empty()) {
             error = createVSLError(kAssetsPathFn, __LINE__, kVSLErrorInvalidObject, nullptr, true,
                                    "No URL in container metadata object: %@", found);
@@ -264,15 +269,8 @@ bool VSLClientConnection::deleteUserManagedAssetWithContainerIdentity(const VSLC
                                    identity ? identity->identifier() : "(null)", relativePath.value_or("(null)"));
             return false;
         }
-        VSLErrorRef underlying;
-        auto found = VSLContainerCache::sharedInstance()->containerForContainerIdentity(identity, false, true,
-                                                                                       &underlying);
-        if (!found) {
-            error = createVSLError(kDeleteAssetFn, __LINE__, kVSLErrorInvalidObject, underlying, true,
-                                   "Failed to create app data container for user managed assets path for %@: %@",
-                                   identity, underlying);
-            return false;
-        }
+        auto found = findDataContainer(kDeleteAssetFn, identity, &error);
+        if (!found) return false;
         VSLIdentifierLockGuard lock({found->uuid().string()}, true);
         found = currentRecord(found);
         if (found->url().empty() || !found->userManagedAssetsDirName()) {
@@ -318,6 +316,7 @@ bool VSLClientConnection::deleteUserManagedAssetWithContainerIdentity(const VSLC
         // directory swapped for one after the check ends the removal.
         const std::string below = std::string(kAssetsParent) + "/" + *found->userManagedAssetsDirName() + "/" +
                                   realTarget->substr(realAssets->size() + 1);
+        VSLErrorRef underlying;
         if (!ops.removeItemBelowDirectory(*realContainer, below, &underlying)) {
             error = createVSLError(kDeleteAssetFn, __LINE__, kVSLErrorMoveToDeathRow, underlying, true,
                                    "Failed to remove asset at %@", *realTarget);
