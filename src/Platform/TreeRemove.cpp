@@ -95,12 +95,16 @@ private:
 }  // namespace
 
 int removeTree(const std::string& path, const std::function<void(const RemoveFailure&)>& onError) {
-    std::string name = lastPathComponent(path);
     UniqueFd parentFd(::open(parentPath(path).c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
     if (!parentFd.valid()) return errno;
+    return removeTreeAt(parentFd.get(), lastPathComponent(path), path, onError);
+}
+
+int removeTreeAt(int parentFd, const std::string& name, const std::string& path,
+                 const std::function<void(const RemoveFailure&)>& onError) {
     struct stat st;
-    if (::fstatat(parentFd.get(), name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
-    TreeRemover(parentFd.get(), onError).remove(name, S_ISDIR(st.st_mode) ? DT_DIR : DT_REG, path);
+    if (::fstatat(parentFd, name.c_str(), &st, AT_SYMLINK_NOFOLLOW) != 0) return errno;
+    TreeRemover(parentFd, onError).remove(name, S_ISDIR(st.st_mode) ? DT_DIR : DT_REG, path);
     return 0;
 }
 

@@ -21,5 +21,9 @@ struct RemoveFailure {
 // Returns 0 when the walk ran (per-item failures only reach `onError`), or the errno
 // that kept it from starting: ENOENT when nothing is at `path`.
 int removeTree(const std::string& path, const std::function<void(const RemoveFailure&)>& onError);
+// The same for the entry `name` of the directory `parentFd` (which may be an O_PATH
+// descriptor): nothing on the way to it is looked up by path. `path` only names it.
+int removeTreeAt(int parentFd, const std::string& name, const std::string& path,
+                 const std::function<void(const RemoveFailure&)>& onError);
 
 }  // namespace vsl

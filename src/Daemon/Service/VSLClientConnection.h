@@ -103,6 +103,21 @@ public:
                                                       uint64_t* code);
     std::optional<uint64_t> diskUsageWithContainerIdentity(const VSLConcreteContainerIdentityRef& identity,
                                                            uint64_t* code);
+    // Content operations on paths that clients name (VSLClientConnectionContent.cpp).
+    // Every client path is resolved once and only the resolved result is used.
+    // Wipe: the container keeps identity, UUID and place; its content becomes a fresh
+    // skeleton, the old content goes through death row.
+    bool deleteDataContainerContentWithContainerIdentity(const VSLContainerIdentityRef& identity, uint64_t* code);
+    // Moves a tree inside a system group container; returns the destination.
+    std::optional<std::string> stageSharedContentForIdentifier(const Value& identifier, const Value& sourceRelativePath,
+                                                               const Value& destRelativePath, uint64_t* code);
+    // "Library/<name>" or the absolute path of the container's assets directory.
+    std::optional<std::string> userManagedAssetsPathWithContainerIdentity(const VSLContainerIdentityRef& identity,
+                                                                          bool isRelative, bool createIfNecessary,
+                                                                          bool* existed, uint64_t* code);
+    bool deleteUserManagedAssetWithContainerIdentity(const VSLContainerIdentityRef& identity,
+                                                     const std::optional<std::string>& relativePath, uint64_t* code);
+
     // Exits the process while crashes remain (VSLRetryTest.cpp).
     bool retryTestWithNumCrashes(uint64_t numCrashes, uint64_t* code);
 
@@ -128,6 +143,8 @@ private:
     VSLClientConnection() = default;
     bool mayAccess(const VSLContainerIdentity& identity, uint64_t* code);
     VSLMetadataRef createContainer(const VSLContainerIdentityRef& identity, bool transient, VSLErrorRef* error);
+    std::optional<std::string> makeUserManagedAssetsDirectory(const std::string& parent, const VSLMetadata& container,
+                                                              VSLErrorRef* error);
     bool _lock_setInfoValue(const std::optional<Value>& value, const std::string& key,
                             const VSLConcreteContainerIdentityRef& identity, VSLErrorRef* error);
 

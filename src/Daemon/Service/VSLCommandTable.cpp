@@ -4,6 +4,7 @@
 #include "Daemon/CodeSigning/VSLCodeSigningHandlers.h"
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Daemon/Service/VSLContainerHandlers.h"
+#include "Daemon/Service/VSLContentHandlers.h"
 #include "Daemon/Service/VSLEntitlements.h"
 #include "Daemon/Service/VSLGroupHandlers.h"
 #include "Daemon/Service/VSLInfoHandlers.h"
@@ -33,8 +34,8 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {8, handleRecreateDefaultStructure, A, 0x1},
     {9, handleRegenerateDirectoryUUID, A, 0x1},
     {10, handleDeleteContainer, A, 0x1},
-    {11, nullptr, kVSLEntitlementWipeContainer, 0x1},
-    {12, nullptr, kVSLEntitlementDeleteContainerContent, 0x1},
+    {11, handleWipeContainer, kVSLEntitlementWipeContainer, 0x1},
+    {12, handleDeleteContainerContent, kVSLEntitlementDeleteContainerContent, 0x1},
     {13, handleCreateOrLookupGroupContainers, A, 0x10101},
     {14, handleGroupContainerIdentifiers, A, 0x10001},
     {15, handleSystemContainerPath, A, 0x10101},
@@ -48,10 +49,10 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {23, handleDiskUsage, A, 0x10001},
     {24, nullptr, kVSLEntitlementDataMigration, 0x1},
     {25, handleRetryTest, kVSLEntitlementTestability, 0x1},
-    {26, nullptr, kVSLEntitlementStageSharedContent, 0x1},
+    {26, handleStageSharedContent, kVSLEntitlementStageSharedContent, 0x1},
     {27, retiredCommand, A, 0x1},
-    {28, nullptr, kVSLEntitlementUserManagedAssets, 0x101},
-    {29, nullptr, kVSLEntitlementUserManagedAssets, 0x1},
+    {28, handleUserManagedAssetsPath, kVSLEntitlementUserManagedAssets, 0x101},
+    {29, handleDeleteUserManagedAsset, kVSLEntitlementUserManagedAssets, 0x1},
     {30, nullptr, kVSLEntitlementDataMigration, 0x1},
     {31, handleSetTestLock, kVSLEntitlementTestability, 0x1},
     {32, listAccessiblePersonas, A, 0x10101},

@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <climits>
 #include <cstdlib>
@@ -208,14 +209,13 @@ bool VSLFileManager::copyItemIfExistsAtURL(const std::string& from, const std::s
 
 // ---- removal ----
 
-bool VSLFileManager::removeItemAtURL(const std::string& url, VSLErrorRef* error) const {
-    if (url.empty()) {
-        setError(error, VSL_POSIX_ERROR(EFAULT, "nil url passed to -removeItemAtURL:error:"));
-        return false;
-    }
-    // The first failure is the one reported; an item that vanished meanwhile is none.
+namespace {
+
+// The removal's per-item failures: the first one is the one reported; an item that
+// vanished meanwhile is none.
+int removeWith(const std::function<int(const std::function<void(const RemoveFailure&)>&)>& remove) {
     int firstError = 0;
-    int rc = removeTree(url, [&](const RemoveFailure& failure) {
+    int rc = remove([&](const RemoveFailure& failure) {
         if (failure.error != ENOENT)
             LogWrite(kLogLevelError, kRemoveFunction, "removefile hit error for %s : %s", failure.path,
                      std::strerror(failure.error));
@@ -223,12 +223,51 @@ bool VSLFileManager::removeItemAtURL(const std::string& url, VSLErrorRef* error)
         if (firstError == 0 && failure.error != ENOENT) firstError = failure.error;
     });
     if (rc == ENOENT) rc = 0;
-    if (rc == 0) rc = firstError;
+    return rc ? rc : firstError;
+}
+
+}  // namespace
+
+bool VSLFileManager::removeItemAtURL(const std::string& url, VSLErrorRef* error) const {
+    if (url.empty()) {
+        setError(error, VSL_POSIX_ERROR(EFAULT, "nil url passed to -removeItemAtURL:error:"));
+        return false;
+    }
+    int rc = removeWith([&](const auto& onError) { return removeTree(url, onError); });
     if (rc) {
         setError(error, VSL_POSIX_ERROR(rc, "removefile of %@ failed: %s", url, std::strerror(rc)));
         return false;
     }
     return true;
+}
+
+bool VSLFileManager::removeItemBelowDirectoryAtURL(const std::string& directory, const std::string& relativePath,
+                                                   VSLErrorRef* error) const {
+    const std::string path = joinPath(directory, relativePath);
+    auto fail = [&](int rc) {
+        setError(error, createPOSIXError("-[VSLFileManager removeItemBelowDirectoryAtURL:relativePath:error:]",
+                                         __LINE__, rc, "removefile of %@ failed: %s", path, std::strerror(rc)));
+        return false;
+    };
+    std::vector<std::string> names;
+    for (size_t at = 0; at <= relativePath.size();) {
+        size_t end = std::min(relativePath.find('/', at), relativePath.size());
+        std::string name = relativePath.substr(at, end - at);
+        if (name.empty() || name == "." || name == "..") return fail(EINVAL);
+        names.push_back(std::move(name));
+        at = end + 1;
+    }
+    // Every step is relative to the one before and follows no link: a directory
+    // swapped for a link on the way ends the removal (ELOOP, ENOTDIR).
+    UniqueFd parent;
+    if (int rc = durable::openDirectoryNoFollow(directory, parent.out())) return fail(rc);
+    for (size_t i = 0; i + 1 < names.size(); i++) {
+        UniqueFd next(::openat(parent.get(), names[i].c_str(), O_PATH | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+        if (!next.valid()) return fail(errno);
+        parent = std::move(next);
+    }
+    int rc = removeWith([&](const auto& onError) { return removeTreeAt(parent.get(), names.back(), path, onError); });
+    return rc ? fail(rc) : true;
 }
 
 // ---- existence and listing ----

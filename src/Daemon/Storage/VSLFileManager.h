@@ -72,6 +72,11 @@ public:
 
     // A file or a whole tree; missing is success. An empty URL fails with EFAULT.
     bool removeItemAtURL(const std::string& url, VSLErrorRef* error) const;
+    // The same for `relativePath` (plain names, no "." or "..") below `directory`,
+    // reached through descriptors that follow no link. A missing item is success, a
+    // directory missing (or a link) on the way to it is not.
+    bool removeItemBelowDirectoryAtURL(const std::string& directory, const std::string& relativePath,
+                                       VSLErrorRef* error) const;
 
     // Existence of the item itself (a final link is not followed).
     bool itemExistsAtURL(const std::string& url) const;

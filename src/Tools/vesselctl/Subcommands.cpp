@@ -1,5 +1,7 @@
 #include "Subcommands.h"
 
+#include "ContentSubcommands.h"
+
 #include <cstdlib>
 #include <cstring>
 
@@ -79,7 +81,7 @@ std::optional<Dictionary> subcommandRequest(int argc, char** argv, int* index, s
         *index = i + 2;
         return request;
     } else {
-        return std::nullopt;
+        return contentSubcommandRequest(argc, argv, index, error);
     }
     *index = i + 1;
     return request;

@@ -10,6 +10,7 @@
 #include "Client/VSLConnection.h"
 #include "Client/VSLProtocol.h"
 #include "Platform/PropertyList.h"
+#include "ContentSubcommands.h"
 #include "Subcommands.h"
 
 using namespace vsl;
@@ -31,7 +32,7 @@ int usage(FILE* out) {
                  "\n"
                  "commands:\n");
     for (uint64_t i = 0; i < kVSLProtocolCommandCount; i++) std::fprintf(out, "  %2llu  %s\n", (unsigned long long)i, commandName(i));
-    std::fprintf(out, "\nsubcommands:\n%s%s", kSubcommandUsage, kGroupSubcommandUsage);
+    std::fprintf(out, "\nsubcommands:\n%s%s%s", kSubcommandUsage, kGroupSubcommandUsage, kContentSubcommandUsage);
     std::fprintf(out,
                  "\n"
                  "replace (replaceContainer): puts a prepared container in the place of an old one\n"
