@@ -9,6 +9,7 @@
 //   du                             diskUsage
 //   test-lock N on|off             setTestLock
 //   retry-test N                   retryTest
+//   protect CLASS                  setDataProtection (ContainerClass 2 unless given)
 #pragma once
 
 #include <optional>
