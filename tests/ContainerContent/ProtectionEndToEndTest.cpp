@@ -324,3 +324,40 @@ TEST(Protection, PendingChangesResumeAtTheNextStartAndAMovedContainerCancelsItsC
     EXPECT_EQ(1, classOf(app.path + "/Documents/a"));
     EXPECT_EQ(1, recordedClass(*c, app));
 }
+
+TEST(Protection, NewDataContainersTakeTheClassTheirEntitlementsName) {
+    DaemonProcess daemon;
+    registerSelf(daemon);
+    startDaemon(daemon);
+    auto c = connectTo(daemon);
+    ASSERT_TRUE(c);
+    auto store = [&](const std::string& identifier, const char* key, const char* level) {
+        Dictionary entitlements;
+        if (key) entitlements.emplace(key, Value::string(level));
+        return send(*c, {{"Command", Value::uint64(18)},
+                         {"Identifier", Value::string(identifier)},
+                         {"CodeSigningInfo", dict({{"com.tarrow.Vesselry.Entitlements", Value::dictionary(entitlements)},
+                                                   {"Version", Value::uint64(3)}})}});
+    };
+    struct Case {
+        const char* identifier;
+        const char* key;
+        const char* level;
+        int expected;
+    } cases[] = {
+        {"com.example.complete", "com.tarrow.developer.default-data-protection", "com.tarrow.protection.complete", 1},
+        {"com.example.none", "data-protection-class", "com.tarrow.protection.none", 4},
+        {"com.example.writeonly", "DataProtectionClass", "com.tarrow.protection.write-only", 2},
+        {"com.example.firstauth", "DataProtectionClass", "com.tarrow.protection.complete-until-user-authentication", 3},
+        {"com.example.unknown", "DataProtectionClass", "complete", 0},
+        {"com.example.plain", nullptr, nullptr, 0},
+    };
+    for (const auto& k : cases) {
+        ASSERT_EQ(1u, store(k.identifier, k.key, k.level)) << k.identifier;
+        Created made = createContainer(*c, k.identifier, 2);
+        ASSERT_FALSE(made.path.empty());
+        EXPECT_EQ(k.expected, classOf(made.path + "/Documents")) << k.identifier;
+        EXPECT_EQ(0, classOf(made.path + "/SystemData")) << k.identifier;
+    }
+    EXPECT_TRUE(waitForLog(daemon, "Unknown value for DataProtectionClass entitlement: complete; defaulting to class 0"));
+}

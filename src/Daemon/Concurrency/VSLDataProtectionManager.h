@@ -15,7 +15,7 @@
 namespace vsl {
 
 // The protection-level names entitlements carry ("com.tarrow.protection." + level)
-// and the class each stands for.
+// and the class each stands for (the table of docs/operations.md).
 struct VSLProtectionLevelName {
     const char* name;
     int32_t protectionClass;
