@@ -19,17 +19,7 @@ Value setDataProtectionRequest(const VSLProtectionChange& change) {
 
 uint64_t setDataProtection(VSLConnection& connection, const VSLProtectionChange& change, std::string* error,
                            std::optional<std::chrono::milliseconds> timeout) {
-    VSLReply reply = connection.sendRequest(setDataProtectionRequest(change), timeout);
-    if (!reply.ok()) {
-        if (error) *error = std::string(statusName(reply.status)) + ": " + reply.error;
-        return 0;
-    }
-    const Value* code = reply.body.find("ReplyError");
-    if (!code || !code->uint64Value()) {
-        if (error) *error = "reply without a result code";
-        return 0;
-    }
-    return *code->uint64Value();
+    return resultCode(connection.sendRequest(setDataProtectionRequest(change), timeout), error);
 }
 
 bool isLaunchBlocked(const std::string& root, const std::string& identifier) {

@@ -114,6 +114,26 @@ bool exitsKilled(pid_t pid) {
     return false;
 }
 
+// Two class-2 containers at class 3, each with a file at class 3; the daemon is then
+// restarted with the device locked, so that changes to class 1 park.
+std::pair<Created, Created> preparedAndLocked(DaemonProcess& daemon, const std::string& second) {
+    Created first, other;
+    {
+        auto c = connectTo(daemon);
+        if (!c) return {};
+        first = createContainer(*c, kApp, 2);
+        other = createContainer(*c, second, 2);
+        EXPECT_EQ(1u, protect(daemon, kApp, 3));
+        EXPECT_EQ(1u, protect(daemon, second, 3));
+        makeFile(first.path + "/Documents/a", 3);
+        makeFile(other.path + "/Documents/a", 3);
+    }
+    EXPECT_EQ(0, daemon.stop());
+    keybag(daemon, "lock");
+    startDaemon(daemon);
+    return {first, other};
+}
+
 }  // namespace
 
 TEST(Protection, ReclassesUserDataThroughTheWalkAndRecordsTheClass) {
@@ -201,22 +221,10 @@ TEST(Protection, ALockedDeviceParksTheChangeUntilUnlockWithTheAppHeldTerminated)
     fs::copy_file("/bin/sleep", victimPath);
     ASSERT_TRUE(daemon.registerProgram(victimPath, "victim", kApp, dict({})));
     startDaemon(daemon);
-    {
-        auto c = connectTo(daemon);
-        ASSERT_TRUE(c);
-        Created app = createContainer(*c, kApp, 2);
-        Created other = createContainer(*c, "com.example.other", 2);
-        ASSERT_EQ(1u, protect(daemon, kApp, 3));
-        ASSERT_EQ(1u, protect(daemon, "com.example.other", 3));
-        makeFile(app.path + "/Documents/a", 3);
-        makeFile(other.path + "/Documents/a", 3);
-    }
-    ASSERT_EQ(0, daemon.stop());
-    keybag(daemon, "lock");
-    startDaemon(daemon);
+    Created app = preparedAndLocked(daemon, "com.example.other").first;
+    ASSERT_FALSE(app.path.empty());
     auto c = connectTo(daemon);
     ASSERT_TRUE(c);
-    Created app = createContainer(*c, kApp, 2);
 
     // Without retry the change fails at once and leaves no file.
     EXPECT_EQ(61u, protect(daemon, "com.example.other", 1));
@@ -269,20 +277,8 @@ TEST(Protection, PendingChangesResumeAtTheNextStartAndAMovedContainerCancelsItsC
     DaemonProcess daemon;
     registerSelf(daemon);
     startDaemon(daemon);
-    Created app, moved;
-    {
-        auto c = connectTo(daemon);
-        ASSERT_TRUE(c);
-        app = createContainer(*c, kApp, 2);
-        moved = createContainer(*c, "com.example.moved", 2);
-        ASSERT_EQ(1u, protect(daemon, kApp, 3));
-        ASSERT_EQ(1u, protect(daemon, "com.example.moved", 3));
-        makeFile(app.path + "/Documents/a", 3);
-        makeFile(moved.path + "/Documents/a", 3);
-    }
-    ASSERT_EQ(0, daemon.stop());
-    keybag(daemon, "lock");
-    startDaemon(daemon);
+    auto [app, moved] = preparedAndLocked(daemon, "com.example.moved");
+    ASSERT_FALSE(moved.path.empty());
     auto parkedApp = protectAsync(daemon, kApp, 1);
     auto parkedMoved = protectAsync(daemon, "com.example.moved", 1);
     ASSERT_TRUE(waitForLog(daemon, "Retrying container protection update to 1 on next unlock", 2));
