@@ -294,4 +294,17 @@ void VSLConnection::receiveAvailable() {
     inbox_.erase(0, pos);
 }
 
+uint64_t resultCode(const VSLReply& reply, std::string* error) {
+    if (!reply.ok()) {
+        if (error) *error = std::string(statusName(reply.status)) + ": " + reply.error;
+        return 0;
+    }
+    const Value* code = reply.body.find("ReplyError");
+    if (!code || !code->uint64Value()) {
+        if (error) *error = "reply without a result code";
+        return 0;
+    }
+    return *code->uint64Value();
+}
+
 }  // namespace vsl::client

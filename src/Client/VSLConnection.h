@@ -40,6 +40,9 @@ struct VSLReply {
     bool ok() const { return status == VSLConnectionStatus::Ok; }
 };
 
+// "ReplyError" of a reply, or 0 with `error` set when no reply or no code came.
+uint64_t resultCode(const VSLReply& reply, std::string* error);
+
 class VSLConnection {
     struct Passkey {};
 

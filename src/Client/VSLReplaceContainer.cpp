@@ -27,17 +27,7 @@ Value replaceContainerRequest(const std::optional<VSLContainerReference>& oldCon
 uint64_t replaceContainer(VSLConnection& connection, const std::optional<VSLContainerReference>& oldContainer,
                           const VSLContainerReference& newContainer, std::string* error,
                           std::optional<std::chrono::milliseconds> timeout) {
-    VSLReply reply = connection.sendRequest(replaceContainerRequest(oldContainer, newContainer), timeout);
-    if (!reply.ok()) {
-        if (error) *error = std::string(statusName(reply.status)) + ": " + reply.error;
-        return 0;
-    }
-    const Value* code = reply.body.find("ReplyError");
-    if (!code || !code->uint64Value()) {
-        if (error) *error = "reply without a result code";
-        return 0;
-    }
-    return *code->uint64Value();
+    return resultCode(connection.sendRequest(replaceContainerRequest(oldContainer, newContainer), timeout), error);
 }
 
 }  // namespace vsl::client

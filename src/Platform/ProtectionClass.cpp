@@ -9,6 +9,7 @@
 #include <string_view>
 
 #include "Platform/DurableIO.h"
+#include "Platform/Keybag.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {
@@ -18,17 +19,6 @@ const char* protectionClassAttributeName() {
     static const char* const name =
         ::geteuid() == 0 ? "trusted.vessel.protection-class" : "user.vessel.protection-class";
     return name;
-}
-
-std::string keybagLockStatePath() { return rootedPath("/run/vesseld/keybag/lockstate"); }
-
-bool keybagIsLocked() {
-    int fd = ::open(keybagLockStatePath().c_str(), O_RDONLY | O_CLOEXEC);
-    if (fd < 0) return false;
-    char c = '0';
-    ssize_t n = ::read(fd, &c, 1);
-    ::close(fd);
-    return n == 1 && c == '1';
 }
 
 int getProtectionClass(int fd, int* protectionClass) {
@@ -53,7 +43,7 @@ int setProtectionClass(int fd, const std::string& path, int protectionClass) {
     int current = kProtectionClassNone;
     if (int rc = getProtectionClass(fd, &current)) return rc;
     if (current == protectionClass) return 0;
-    if ((current == kProtectionClassComplete || protectionClass == kProtectionClassComplete) && keybagIsLocked())
+    if ((current == kProtectionClassComplete || protectionClass == kProtectionClassComplete) && keybagLockState() == kKeybagLocked)
         return EPERM;
     std::string text = std::to_string(protectionClass);
     return durable::setXattr(fd, path, protectionClassAttributeName(), text.data(), text.size());

@@ -14,10 +14,6 @@ constexpr int kProtectionClassComplete = 1;
 
 const char* protectionClassAttributeName();
 
-// run/vesseld/keybag/lockstate below the system root: "1" locked, "0" or missing unlocked.
-std::string keybagLockStatePath();
-bool keybagIsLocked();
-
 // `fd` is a descriptor of the item (O_PATH is fine). Return 0 or an errno value.
 int getProtectionClass(int fd, int* protectionClass);
 // Writes only when the class differs; `path` names the durable step.

@@ -69,4 +69,9 @@ std::string lastPathComponent(std::string_view path) {
     return slash == std::string::npos ? p : p.substr(slash + 1);
 }
 
+bool isPlainPathComponent(std::string_view name) {
+    return !name.empty() && name != "." && name != ".." && name.find('/') == std::string_view::npos &&
+           name.find('\0') == std::string_view::npos;
+}
+
 }  // namespace vsl

@@ -23,5 +23,7 @@ std::string unrootedPath(std::string_view hostPath);
 std::string joinPath(std::string_view dir, std::string_view name);
 std::string parentPath(std::string_view path);
 std::string lastPathComponent(std::string_view path);
+// One plain name component: not empty, ".", "..", and without "/" or NUL.
+bool isPlainPathComponent(std::string_view name);
 
 }  // namespace vsl

@@ -5,6 +5,7 @@
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/CodeSigning/VSLWhitelist.h"
 #include "Daemon/Concurrency/VSLCommandStageForDelete.h"
+#include "Daemon/Concurrency/VSLDataProtectionManager.h"
 #include "Daemon/Concurrency/VSLLocks.h"
 #include "Daemon/Concurrency/VSLTestLocks.h"
 #include "Daemon/Core/VSLErrorCodes.h"
@@ -63,9 +64,8 @@ int32_t VSLClientConnection::_dataProtectionClassForContainerMetadata(const VSLM
         const Value* v = metadata.info()->find("com.tarrow.Stowage.ContentProtectionClass");
         if (v && v->signedNumber()) return static_cast<int32_t>(*v->signedNumber());
     }
-    // The entitlement-derived class comes from the data protection manager, which
-    // this build does not have: such containers get no protection class.
-    return 0;
+    return VSLDataProtectionManager::defaultManager().intendedDataProtectionClassBasedOnEntitlementsForIdentifier(
+        metadata.identifier());
 }
 
 bool VSLClientConnection::_createSubDirectories(const std::string& url, const VSLMetadata& metadata,

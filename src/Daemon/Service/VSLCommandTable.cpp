@@ -8,6 +8,7 @@
 #include "Daemon/Service/VSLEntitlements.h"
 #include "Daemon/Service/VSLGroupHandlers.h"
 #include "Daemon/Service/VSLInfoHandlers.h"
+#include "Daemon/Service/VSLProtectionHandler.h"
 #include "Daemon/Service/VSLReplaceHandler.h"
 #include "Daemon/Service/VSLRequestDecoding.h"
 #include "Platform/Log.h"
@@ -44,7 +45,7 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {18, processCodeSigningInfoCommand, A, 0x1},
     {19, getCodeSigningInfoCommand, A, 0x1},
     {20, invalidateCodeSigningInfoCommand, A, 0x1},
-    {21, nullptr, A, 0x0},
+    {21, handleSetDataProtection, A, 0x0},
     {22, handleRecreateDefaultStructure, A, 0x1},
     {23, handleDiskUsage, A, 0x10001},
     {24, nullptr, kVSLEntitlementDataMigration, 0x1},

@@ -5,8 +5,10 @@
 #include <cstdlib>
 
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
+#include "Daemon/Concurrency/VSLDataProtectionManager.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Service/VSLCommandTable.h"
+#include "Daemon/Service/VSLLockState.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
 #include "Platform/CrashAnnotation.h"
 #include "Platform/DeviceFacts.h"
@@ -59,6 +61,14 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     VSLErrorRef replaceError;
     if (!VSLClientConnection::sharedClientConnection()->_recoverFromReplaceOperationsWithError(&replaceError))
         LogWrite(kLogLevelError, "vesseld_init", "Failed to recover replace operations: %@", replaceError);
+
+    // Lock state first, so a change restarted below while the device is locked parks
+    // on a suspended queue.
+    registerForLockStateNotifications();
+    VSLErrorRef protectionError;
+    if (!VSLDataProtectionManager::defaultManager().restartPendingDataProtectionOperationsWithError(&protectionError))
+        LogWrite(kLogLevelError, "vesseld_init", "Failed restarting pending data protection operations: %@",
+                 protectionError);
 
     // Every start: whatever a crash left on death row is destroyed in the background.
     VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);

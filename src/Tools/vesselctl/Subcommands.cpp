@@ -11,7 +11,9 @@ using namespace vsl;
 const char* const kSubcommandUsage =
     "  info get KEY | info set KEY [Value[:type]=V]   (with Identifier= ContainerClass= UUID=)\n"
     "  metadata | recreate-structure | regenerate-uuid | du   (with the same keys)\n"
-    "  test-lock N on|off | retry-test N\n";
+    "  test-lock N on|off | retry-test N\n"
+    "  protect CLASS   (with Identifier= [ContainerClass=2] [RetryIfLocked=true] [IsThirdParty=true])\n"
+    "  keybag lock|unlock|state   (the device lock state of the root; no daemon needed)\n";
 
 namespace {
 
@@ -69,6 +71,18 @@ std::optional<Dictionary> subcommandRequest(int argc, char** argv, int* index, s
         request["TestLock"] = Value::uint64(*lock);
         request["Enable"] = Value::boolean(state == "on");
         *index = i + 3;
+        return request;
+    } else if (word == "protect") {
+        char* end = nullptr;
+        long long cls = i + 1 < argc ? std::strtoll(argv[i + 1], &end, 10) : 0;
+        if (i + 1 >= argc || !*argv[i + 1] || *end) {
+            *error = "usage: vesselctl protect CLASS Identifier=ID [ContainerClass=N] [RetryIfLocked=true]";
+            return Dictionary{};
+        }
+        request = command(21);
+        request["ContainerClass"] = Value::uint64(2);
+        request["DataProtectionClass"] = Value::int64(cls);
+        *index = i + 2;
         return request;
     } else if (word == "retry-test") {
         auto crashes = i + 1 < argc ? number(argv[i + 1]) : std::nullopt;

@@ -11,6 +11,7 @@
 //   retry-test N                   retryTest
 //   groups, group-ids, system-container, system-groups, system-group GROUP
 //                                  commands 13 to 17 (GroupSubcommands.cpp)
+//   protect CLASS                  setDataProtection (ContainerClass 2 unless given)
 #pragma once
 
 #include <optional>

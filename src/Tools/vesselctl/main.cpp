@@ -11,6 +11,7 @@
 #include "Client/VSLProtocol.h"
 #include "Platform/PropertyList.h"
 #include "ContentSubcommands.h"
+#include "Keybag.h"
 #include "Subcommands.h"
 
 using namespace vsl;
@@ -73,6 +74,8 @@ int main(int argc, char** argv) {
         }
     }
     if (i >= argc) return usage(stderr);
+
+    if (std::string(argv[i]) == "keybag") return runKeybagCommand(root, argc - i, argv + i, asJson);
 
     std::string subcommandError;
     std::optional<Dictionary> subcommand = subcommandRequest(argc, argv, &i, &subcommandError);
