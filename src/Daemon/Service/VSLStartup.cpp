@@ -2,12 +2,17 @@
 
 #include <syslog.h>
 
+#include <unistd.h>
+
+#include <cstdio>
 #include <cstdlib>
+#include <string>
 
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Service/VSLCommandTable.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
+#include "Daemon/Upcall/VSLUpcallServer.h"
 #include "Platform/CrashAnnotation.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
@@ -59,6 +64,14 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     VSLErrorRef replaceError;
     if (!VSLClientConnection::sharedClientConnection()->_recoverFromReplaceOperationsWithError(&replaceError))
         LogWrite(kLogLevelError, "vesseld_init", "Failed to recover replace operations: %@", replaceError);
+
+    std::string upcallError;
+    if (!startKernelUpcallServer(&upcallError)) {
+        LogWrite(kLogLevelError, "vesseld_init", "Failed to initialize kernel upcall interface.");
+        std::fprintf(stderr, "vesseld: Failed to initialize kernel upcall interface: %s\n", upcallError.c_str());
+        closeLogFile();
+        ::_exit(1);
+    }
 
     // Every start: whatever a crash left on death row is destroyed in the background.
     VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);
