@@ -1,6 +1,6 @@
 #include "Daemon/Upcall/VSLUpcallDemux.h"
 
-#include "Daemon/Upcall/VSLUpcallProtocol.h"
+#include "Client/VSLUpcallProtocol.h"
 #include "Daemon/Upcall/VSLUpcallRoutine.h"
 #include "Platform/Log.h"
 

@@ -3,7 +3,7 @@
 #include <cstring>
 #include <memory>
 
-#include "Daemon/Upcall/VSLUpcallProtocol.h"
+#include "Client/VSLUpcallProtocol.h"
 #include "Platform/Log.h"
 #include "packbuff/packbuff.h"
 

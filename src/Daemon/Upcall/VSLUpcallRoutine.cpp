@@ -8,7 +8,7 @@
 #include "Daemon/Core/VSLUserIdentityCache.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Storage/VSLMetadata.h"
-#include "Daemon/Upcall/VSLUpcallProtocol.h"
+#include "Client/VSLUpcallProtocol.h"
 #include "Daemon/Upcall/VSLUpcallRequest.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"

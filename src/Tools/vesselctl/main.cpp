@@ -9,8 +9,10 @@
 #include "Client/VSLArguments.h"
 #include "Client/VSLConnection.h"
 #include "Client/VSLProtocol.h"
+#include "Client/VSLUpcallClient.h"
 #include "Platform/PropertyList.h"
 #include "Subcommands.h"
+#include "Upcall.h"
 
 using namespace vsl;
 using namespace vsl::client;
@@ -31,7 +33,7 @@ int usage(FILE* out) {
                  "\n"
                  "commands:\n");
     for (uint64_t i = 0; i < kVSLProtocolCommandCount; i++) std::fprintf(out, "  %2llu  %s\n", (unsigned long long)i, commandName(i));
-    std::fprintf(out, "\nsubcommands:\n%s", kSubcommandUsage);
+    std::fprintf(out, "\nsubcommands:\n%s%s", kSubcommandUsage, kUpcallUsage);
     std::fprintf(out,
                  "\n"
                  "replace (replaceContainer): puts a prepared container in the place of an old one\n"
@@ -72,6 +74,10 @@ int main(int argc, char** argv) {
         }
     }
     if (i >= argc) return usage(stderr);
+    if (std::string(argv[i]) == "upcall") {
+        if (socketPath.empty()) socketPath = VSLUpcallClient::socketPathForSystemRoot(root);
+        return runUpcallSubcommand(socketPath, asJson, timeoutSeconds, argc, argv, i + 1);
+    }
 
     std::string subcommandError;
     std::optional<Dictionary> subcommand = subcommandRequest(argc, argv, &i, &subcommandError);

@@ -1,5 +1,5 @@
-// The kernel's container query: its message ids, the keys of its request and reply
-// packbuffs, and the return codes the routine gives.
+// The kernel's container query, shared by the daemon and the clients that play the
+// kernel: its message ids, the keys of its request and reply packbuffs, return codes.
 #pragma once
 
 #include <cstdint>
