@@ -3,7 +3,6 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
-#include <fstream>
 
 #include "Client/VSLUpcallProtocol.h"
 #include "Platform/PropertyList.h"
@@ -21,13 +20,6 @@ const char* const kAllowed = "com.tarrow.private.Vesselry.allowed";
 const char* const kApplications = "private/var/mobile/Containers/Data/Application";
 const char* const kPlugins = "private/var/mobile/Containers/Data/PluginKitPlugin";
 const char* const kGroups = "private/var/mobile/Containers/Shared/AppGroup";
-
-void writeRootFile(const DaemonProcess& daemon, const std::string& relative, const std::string& bytes) {
-    std::string path = daemon.at(relative);
-    std::string mk = "mkdir -p '" + path.substr(0, path.rfind('/')) + "'";
-    ASSERT_EQ(0, std::system(mk.c_str()));
-    std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
-}
 
 bool isDirectory(const std::string& path) {
     struct stat st;

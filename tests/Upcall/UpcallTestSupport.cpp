@@ -1,9 +1,7 @@
 #include "Upcall/UpcallTestSupport.h"
 
-#include <dirent.h>
 #include <gtest/gtest.h>
 
-#include <algorithm>
 #include <cstdio>
 
 #include "Platform/PropertyList.h"
@@ -61,19 +59,6 @@ void registerCodeSigning(DaemonProcess& daemon, const std::string& installer, co
     auto r = daemon.run(installer, {"processCodeSigningInfo", "Identifier=" + identifier, "CodeSigningInfo=@" + info,
                                     "OptionsDictionary=@" + options});
     ASSERT_EQ(1u, r.code()) << r.err;
-}
-
-std::vector<std::string> entriesOf(const std::string& directory) {
-    std::vector<std::string> names;
-    DIR* d = ::opendir(directory.c_str());
-    if (!d) return names;
-    while (dirent* e = ::readdir(d)) {
-        std::string name = e->d_name;
-        if (name != "." && name != "..") names.push_back(name);
-    }
-    ::closedir(d);
-    std::sort(names.begin(), names.end());
-    return names;
 }
 
 }  // namespace vsl::test

@@ -12,6 +12,7 @@
 
 #include "Client/VSLUpcallClient.h"
 #include "Support/DaemonProcess.h"
+#include "Support/RootFiles.h"
 #include "packbuff/PackbuffTestSupport.h"
 
 namespace vsl::test {
@@ -39,8 +40,5 @@ std::string asString(const packbuff_test::Bytes& bytes);
 // Registers `identifier` in the code-signing database with that data container class.
 void registerCodeSigning(DaemonProcess& daemon, const std::string& installer, const std::string& identifier,
                          uint64_t dataContainerClass);
-
-// Names of the entries of a directory ("" entries excluded); empty when it is missing.
-std::vector<std::string> entriesOf(const std::string& directory);
 
 }  // namespace vsl::test
