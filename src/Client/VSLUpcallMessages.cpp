@@ -3,16 +3,11 @@
 #include <memory>
 
 #include "Client/VSLUpcallProtocol.h"
-#include "packbuff/packbuff.h"
+#include "packbuff/packbuff_handle.hpp"
 
 namespace vsl::client {
 
 namespace {
-
-struct HandleDeleter {
-    void operator()(sb_packbuff* pb) const { sb_packbuff_free(pb); }
-};
-using Handle = std::unique_ptr<sb_packbuff, HandleDeleter>;
 
 bool fail(std::string* error, std::string why) {
     if (error) *error = std::move(why);
@@ -22,7 +17,7 @@ bool fail(std::string* error, std::string why) {
 }  // namespace
 
 std::optional<std::string> packUpcallQuery(const VSLUpcallQuery& query) {
-    Handle pb(sb_packbuff_new(1024));
+    PackbuffHandle pb(sb_packbuff_new(1024));
     if (!pb) return std::nullopt;
     int rc = 0;
     auto string = [&](uint16_t key, const std::string& s) {
@@ -49,7 +44,7 @@ std::optional<std::string> packUpcallQuery(const VSLUpcallQuery& query) {
 
 std::optional<VSLUpcallContainers> unpackUpcallReply(const std::string& packbuff, std::string* error) {
     std::string copy = packbuff;  // the reader wants a mutable buffer
-    Handle pb(sb_packbuff_init_with_buffer(copy.data(), copy.size(), true, SB_PACKBUFF_DEALLOC_NONE));
+    PackbuffHandle pb(sb_packbuff_init_with_buffer(copy.data(), copy.size(), true, SB_PACKBUFF_DEALLOC_NONE));
     if (!pb) {
         fail(error, "the reply is shorter than an end marker");
         return std::nullopt;

@@ -5,17 +5,13 @@
 
 #include "Client/VSLUpcallProtocol.h"
 #include "Platform/Log.h"
-#include "packbuff/packbuff.h"
+#include "packbuff/packbuff_handle.hpp"
 
 namespace vsl {
 
 namespace {
 
 const char* const kFunction = "server_get_process_containers";
-
-struct HandleDeleter {
-    void operator()(sb_packbuff* pb) const { sb_packbuff_free(pb); }
-};
 
 // Unpacks one string item; 0, or the routine's code with the failure logged.
 int32_t unpackString(sb_packbuff* pb, const char* label, std::string* out) {
@@ -90,7 +86,7 @@ int32_t unpackItem(sb_packbuff* pb, uint16_t key, VSLUpcallRequest* r) {
 
 int32_t unpackUpcallRequest(const void* bytes, size_t size, VSLUpcallRequest* request) {
     // A handle that holds data and owns nothing only reads its buffer.
-    std::unique_ptr<sb_packbuff, HandleDeleter> pb(
+    PackbuffHandle pb(
         sb_packbuff_init_with_buffer(const_cast<void*>(bytes), size, true, SB_PACKBUFF_DEALLOC_NONE));
     if (!pb) {
         LogWrite(kLogLevelError, kFunction, "sb_packbuff_init() of request data fails");

@@ -14,18 +14,13 @@
 #include "Platform/Log.h"
 #include "Platform/PersonaInfo.h"
 #include "Platform/SystemRoot.h"
-#include "packbuff/packbuff.h"
+#include "packbuff/packbuff_handle.hpp"
 
 namespace vsl {
 
 namespace {
 
 const char* const kFunction = "server_get_process_containers";
-
-struct HandleDeleter {
-    void operator()(sb_packbuff* pb) const { sb_packbuff_free(pb); }
-};
-using Packbuff = std::unique_ptr<sb_packbuff, HandleDeleter>;
 
 UserManagement& personaService() {
     static const std::shared_ptr<UserManagement> service = UserManagement::create();
@@ -153,7 +148,7 @@ int32_t serve(const void* requestBytes, size_t requestSize, std::string* reply) 
     VSLUpcallRequest request;
     if (int32_t rc = unpackUpcallRequest(requestBytes, requestSize, &request)) return rc;
 
-    Packbuff pb(sb_packbuff_new(4096));
+    PackbuffHandle pb(sb_packbuff_new(4096));
     if (!pb) return kVSLUpcallMemoryFailure;
     VSLUserIdentityRef userIdentity = userIdentityForRequest(request);
     if (!userIdentity) return kVSLUpcallInvalidArgument;
