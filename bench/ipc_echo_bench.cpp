@@ -23,9 +23,11 @@
 #include "Client/VSLConnection.h"
 #include "Platform/IpcServer.h"
 #include "Platform/IpcWire.h"
+#include "bench_socket.h"
 
 using namespace vsl;
 using Clock = std::chrono::steady_clock;
+using namespace vslbench;
 
 namespace {
 
@@ -47,83 +49,6 @@ Value reply() {
                  {"ReplyPath", Value::string("/private/var/mobile/Containers/Data/Application/" + std::string(30, 'p'))},
                  {"ReplyIdentifier", Value::string("com.example.benchmark.application-" + std::string(60, 'x'))}});
 }
-
-bool writeAll(int fd, const char* p, size_t n) {
-    while (n > 0) {
-        const ssize_t w = ::send(fd, p, n, MSG_NOSIGNAL);
-        if (w <= 0) return false;
-        p += w;
-        n -= static_cast<size_t>(w);
-    }
-    return true;
-}
-
-bool readAll(int fd, char* p, size_t n) {
-    while (n > 0) {
-        const ssize_t r = ::recv(fd, p, n, 0);
-        if (r <= 0) return false;
-        p += r;
-        n -= static_cast<size_t>(r);
-    }
-    return true;
-}
-
-int connectTo(const std::string& path) {
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-    const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (::connect(fd, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0) {
-        std::perror("connect");
-        std::exit(1);
-    }
-    return fd;
-}
-
-// The floor: blocking reads and writes, one thread per connection, no decoding.
-class RawEchoServer {
-public:
-    RawEchoServer(const std::string& path, std::string replyFrame) : reply_(std::move(replyFrame)) {
-        ::unlink(path.c_str());
-        listener_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-        sockaddr_un addr{};
-        addr.sun_family = AF_UNIX;
-        std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-        if (::bind(listener_, reinterpret_cast<sockaddr*>(&addr), sizeof addr) != 0 || ::listen(listener_, 64) != 0) {
-            std::perror("raw echo server");
-            std::exit(1);
-        }
-        acceptor_ = std::thread([this] {
-            for (;;) {
-                const int fd = ::accept(listener_, nullptr, nullptr);
-                if (fd < 0) return;
-                std::thread([this, fd] { serve(fd); }).detach();
-            }
-        });
-    }
-    ~RawEchoServer() {
-        ::shutdown(listener_, SHUT_RDWR);
-        ::close(listener_);
-        acceptor_.join();
-    }
-
-private:
-    void serve(int fd) {
-        std::vector<char> buffer(kIpcMaxFrameLength);
-        for (;;) {
-            uint32_t length;
-            if (!readAll(fd, reinterpret_cast<char*>(&length), 4) || length > buffer.size() ||
-                !readAll(fd, buffer.data(), length) || !writeAll(fd, reply_.data(), reply_.size())) {
-                break;
-            }
-        }
-        ::close(fd);
-    }
-
-    std::string reply_;
-    int listener_ = -1;
-    std::thread acceptor_;
-};
 
 struct Result {
     double microsPerRoundTrip;   // one client, median of the runs

@@ -9,6 +9,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "Client/VSLUnixSocket.h"
 #include "Platform/IpcWire.h"
 
 namespace vsl::client {
@@ -46,9 +47,7 @@ const char* statusName(VSLConnectionStatus status) {
 }
 
 std::string VSLConnection::socketPathForSystemRoot(const std::string& root) {
-    std::string base = root;
-    while (!base.empty() && base.back() == '/') base.pop_back();
-    return base + "/run/vesseld/com.tarrow.vesseld";
+    return pathBelowSystemRoot(root, "run/vesseld/com.tarrow.vesseld");
 }
 
 std::shared_ptr<VSLConnection> VSLConnection::connectToSystemRoot(const std::string& root,
@@ -57,24 +56,9 @@ std::shared_ptr<VSLConnection> VSLConnection::connectToSystemRoot(const std::str
 }
 
 std::shared_ptr<VSLConnection> VSLConnection::connect(const std::string& socketPath, std::string* error) {
-    sockaddr_un addr{};
-    addr.sun_family = AF_UNIX;
-    if (socketPath.empty() || socketPath.size() >= sizeof addr.sun_path) {
-        if (error) *error = "unusable socket path \"" + socketPath + "\"";
-        return nullptr;
-    }
-    std::memcpy(addr.sun_path, socketPath.c_str(), socketPath.size() + 1);
-    const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-    if (fd < 0 || ::connect(fd, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0) {
-        const int saved = errno;
-        if (error) *error = "cannot connect to " + socketPath + ": " + std::strerror(saved);
-        if (fd >= 0) ::close(fd);
-        errno = saved;
-        return nullptr;
-    }
-    // Waits happen in poll(), where the deadlines live.
-    ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) | O_NONBLOCK);
-    return std::make_shared<VSLConnection>(Passkey{}, fd);
+    UniqueFd fd = connectUnixStream(socketPath, error);
+    if (!fd) return nullptr;
+    return std::make_shared<VSLConnection>(Passkey{}, fd.release());
 }
 
 VSLConnection::VSLConnection(Passkey, int fd) : fd_(fd) {}

@@ -14,7 +14,6 @@
 #include <thread>
 #include <vector>
 
-#include "Platform/IpcWire.h"
 #include "Platform/Log.h"
 
 namespace vsl {
@@ -51,17 +50,22 @@ size_t connectionsTheDescriptorLimitAllows() {
 }
 
 // Tells the peer why before hanging up; a fresh socket always has room for this.
-void refuse(int fd, const std::string& reason) {
-    if (auto frame = encodeFrame(kIpcNoticeMessageId, kIpcFlagReply, dict({{kIpcRefusalKey, Value::string(reason)}}))) {
+void refuse(int fd, const IpcFraming& framing, const std::string& reason) {
+    if (auto frame = framing.encodeRefusal(reason)) {
         [[maybe_unused]] ssize_t n = ::send(fd, frame->data(), frame->size(), MSG_DONTWAIT | MSG_NOSIGNAL);
     }
     ::close(fd);
 }
 
+IpcServerOptions withDefaultFraming(IpcServerOptions options) {
+    if (!options.framing) options.framing = dictionaryFraming();
+    return options;
+}
+
 }  // namespace
 
 IpcEventLoop::IpcEventLoop(IpcServerOptions options, int listenFd)
-    : options_(std::move(options)), listenFd_(listenFd), ownUid_(::geteuid()) {}
+    : options_(withDefaultFraming(std::move(options))), listenFd_(listenFd), ownUid_(::geteuid()) {}
 
 IpcEventLoop::~IpcEventLoop() {
     if (epollFd_ >= 0) ::close(epollFd_);
@@ -252,7 +256,7 @@ void IpcEventLoop::admit(int fd) {
         refusal = reserveLocked(cred.uid);
     }
     if (refusal) {
-        refuse(fd, *refusal);
+        refuse(fd, *options_.framing, *refusal);
         return;
     }
     auto giveBack = [&] {

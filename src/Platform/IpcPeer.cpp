@@ -9,7 +9,6 @@
 #include <vector>
 
 #include "Platform/IpcEventLoop.h"
-#include "Platform/IpcWire.h"
 #include "Platform/Log.h"
 
 namespace vsl {
@@ -108,24 +107,18 @@ bool IpcPeer::handleFrames(const char** why) {
     size_t pos = 0;
     bool ok = true;
     const auto* bytes = reinterpret_cast<const uint8_t*>(inbox_.data());
-    while (inbox_.size() - pos >= kIpcLengthPrefix) {
-        auto length = decodeFrameLength(bytes + pos);
-        if (!length) {
-            *why = "protocol error: bad frame length";
-            ok = false;
-            break;
-        }
-        if (inbox_.size() - pos - kIpcLengthPrefix < *length) break;
-        std::string error;
-        auto frame = decodeFrameBody(bytes + pos + kIpcLengthPrefix, *length, &error);
-        pos += kIpcLengthPrefix + *length;
-        if (!frame || frame->flags != 0) {
-            osLog(LogCategory::Ipc, OSLogLevel::Error, "protocol error from pid %d: %s",
-                  credentials_.pid, frame ? std::string("reply flag on a request") : error);
+    const IpcFraming& framing = *loop_->options().framing;
+    while (pos < inbox_.size()) {
+        IpcDecoded decoded = framing.decode(bytes + pos, inbox_.size() - pos);
+        if (decoded.kind == IpcDecoded::Kind::NeedMore) break;
+        if (decoded.kind == IpcDecoded::Kind::Error) {
+            osLog(LogCategory::Ipc, OSLogLevel::Error, "protocol error from pid %d: %s", credentials_.pid,
+                  decoded.error);
             *why = "protocol error";
             ok = false;
             break;
         }
+        pos += decoded.consumed;
         {
             std::lock_guard lock(mutex_);
             if (closed_) {
@@ -133,10 +126,10 @@ bool IpcPeer::handleFrames(const char** why) {
                 *why = "cancelled";
                 break;
             }
-            pending_.emplace(frame->messageId, Transaction("com.tarrow.vesseld.peer-message"));
+            pending_.emplace(decoded.message.id, Transaction("com.tarrow.vesseld.peer-message"));
         }
         if (const auto& handler = loop_->options().onMessage) {
-            handler(shared_from_this(), IpcMessage{frame->messageId, std::move(frame->body)});
+            handler(shared_from_this(), std::move(decoded.message));
         }
         if (isCancelled()) {
             *why = "cancelled";
@@ -152,9 +145,18 @@ bool IpcPeer::handleFrames(const char** why) {
     return ok;
 }
 
+void IpcPeer::noReply(uint64_t messageId) {
+    std::optional<Transaction> ended;  // ends outside the lock
+    std::lock_guard lock(mutex_);
+    if (auto it = pending_.find(messageId); it != pending_.end()) {
+        ended.emplace(std::move(it->second));
+        pending_.erase(it);
+    }
+}
+
 bool IpcPeer::sendReply(uint64_t messageId, const Value& body) {
     std::string error;
-    auto frame = encodeFrame(messageId, kIpcFlagReply, body, &error);
+    auto frame = loop_->options().framing->encodeReply(messageId, body, &error);
     if (!frame) {
         osLog(LogCategory::Ipc, OSLogLevel::Error, "cannot encode reply %llu to pid %d: %s",
               static_cast<unsigned long long>(messageId), credentials_.pid, error);

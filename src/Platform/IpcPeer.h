@@ -12,6 +12,7 @@
 #include <unordered_map>
 
 #include "Platform/AuditToken.h"
+#include "Platform/IpcFraming.h"
 #include "Platform/Transaction.h"
 #include "Platform/Value.h"
 #include "Platform/WorkQueue.h"
@@ -19,11 +20,6 @@
 namespace vsl {
 
 class IpcEventLoop;
-
-struct IpcMessage {
-    uint64_t id = 0;
-    Value body;  // a dictionary
-};
 
 class IpcPeer : public std::enable_shared_from_this<IpcPeer> {
     struct Passkey {};
@@ -59,6 +55,8 @@ public:
     // any later time; replies never interleave. False when the peer is closed or the
     // body cannot be encoded (not a dictionary, bad string, too deep or large).
     bool sendReply(uint64_t messageId, const Value& body);
+    // Ends a message that gets no reply, so that it no longer keeps the process alive.
+    void noReply(uint64_t messageId);
 
     // Closes the connection: messages not yet handled are dropped and later
     // replies are refused. Idempotent, any thread.

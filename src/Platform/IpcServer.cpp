@@ -93,7 +93,7 @@ std::unique_ptr<IpcServer> IpcServer::start(IpcServerOptions options, std::strin
     const int fd = ::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0);
     if (fd < 0) return giveUp(std::string("socket: ") + std::strerror(errno));
     if (::bind(fd, reinterpret_cast<const sockaddr*>(&addr), sizeof addr) != 0 ||
-        ::chmod(path.c_str(), 0666) != 0 || ::listen(fd, SOMAXCONN) != 0 ||
+        ::chmod(path.c_str(), options.socketMode) != 0 || ::listen(fd, SOMAXCONN) != 0 ||
         ::stat(path.c_str(), &st) != 0) {
         const std::string text = "cannot listen on " + path + ": " + std::strerror(errno);
         ::close(fd);

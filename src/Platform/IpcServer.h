@@ -28,6 +28,7 @@
 #include <optional>
 #include <string>
 
+#include "Platform/IpcFraming.h"
 #include "Platform/IpcPeer.h"
 #include "Platform/WorkQueue.h"
 
@@ -38,6 +39,10 @@ class IpcEventLoop;
 struct IpcServerOptions {
     std::string path;  // socket path; ignored when listenFd is given
     int listenFd = -1;  // an already listening socket (socket activation); adopted
+    // How bytes become messages and replies become bytes; none for dictionary frames.
+    std::shared_ptr<const IpcFraming> framing;
+    // Mode of the socket file made on `path`.
+    mode_t socketMode = 0666;
     // Called for each message on the peer's queue.
     std::function<void(std::shared_ptr<IpcPeer>, IpcMessage)> onMessage;
     // Called for each new peer on connectionQueue (inline on an I/O thread when
@@ -63,8 +68,8 @@ struct IpcServerOptions {
 class IpcServer {
 public:
     // Binds, listens and starts serving. Refuses when another server answers on the
-    // path; a stale socket file left by a crash is replaced. The socket is mode 0666:
-    // rights come from the policy store, not from file modes.
+    // path; a stale socket file left by a crash is replaced. The socket has the
+    // options' mode, 0666 by default: rights come from the policy store, not from file modes.
     static std::unique_ptr<IpcServer> start(IpcServerOptions options, std::string* error = nullptr);
     ~IpcServer();  // stop()
     IpcServer(const IpcServer&) = delete;

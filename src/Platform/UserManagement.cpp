@@ -76,11 +76,11 @@ bool parsePersona(const Value& entry, const std::string& rootPrefix, PersonaAttr
         return true;
     };
 
-    std::optional<uint64_t> type, personaID, uid, gid;
+    std::optional<uint64_t> type, personaID, uid, gid, kernelType;
     std::optional<std::string> home;
     PersonaAttributes p;
     if (!number("PersonaType", true, &type) || !number("KernelPersonaID", true, &personaID) ||
-        !number("UID", false, &uid) || !number("GID", false, &gid) ||
+        !number("UID", false, &uid) || !number("KernelPersonaType", false, &kernelType) || !number("GID", false, &gid) ||
         !text("PersonaUniqueString", &p.uniqueString) || !text("HomeDirectory", &home) ||
         !flag("Universal", &p.isUniversal) || !flag("System", &p.isSystem))
         return false;
@@ -89,6 +89,7 @@ bool parsePersona(const Value& entry, const std::string& rootPrefix, PersonaAttr
     p.isPersonal = *type == 0;
     p.isEnterprise = *type == 1;
     p.kernelPersonaID = static_cast<uint32_t>(*personaID);
+    if (kernelType) p.kernelPersonaType = static_cast<uint32_t>(*kernelType);
     if (uid) p.uid = static_cast<uid_t>(*uid);
     if (gid) p.gid = static_cast<gid_t>(*gid);
     if (home) p.layoutPath = rootPrefix + (home->empty() || (*home)[0] != '/' ? "/" : "") + *home;

@@ -9,6 +9,7 @@
 //   "HomeDirectory"        string, a path inside the system root (enterprise home)
 //   "BundleIdentifiers"    array of strings
 //   "Universal", "System"  booleans, only with type 2: what kind of unspecific persona
+//   "KernelPersonaType"    number: the type the kernel's persona query reports
 // A missing file means no personas. An unreadable, empty or malformed file (any entry
 // of the wrong shape) is logged and the last good list stays in force.
 //
@@ -36,6 +37,7 @@ struct PersonaAttributes {
     bool isSystem = false;
     std::optional<std::string> uniqueString;
     uint32_t kernelPersonaID = 0;
+    std::optional<uint32_t> kernelPersonaType;
     std::optional<uid_t> uid;
     std::optional<gid_t> gid;
     std::vector<std::string> bundleIdentifiers;

@@ -22,13 +22,6 @@ namespace vsl::test {
 const char* const kAllowedEntitlement = "com.tarrow.private.Vesselry.allowed";
 const char* const kTestabilityEntitlement = "com.tarrow.private.Vesselry.testability";
 
-void writeRootFile(const DaemonProcess& daemon, const std::string& relative, const std::string& bytes) {
-    std::string path = daemon.at(relative);
-    std::string mk = "mkdir -p '" + path.substr(0, path.rfind('/')) + "'";
-    ASSERT_EQ(0, std::system(mk.c_str()));
-    std::ofstream(path, std::ios::binary | std::ios::trunc) << bytes;
-}
-
 void writeDeviceFacts(const DaemonProcess& daemon, const Value& facts) {
     writeRootFile(daemon, "etc/vesseld/device.plist", *encodeBinaryPropertyList(facts, nullptr));
 }

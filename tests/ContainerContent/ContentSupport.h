@@ -9,6 +9,7 @@
 
 #include "Client/VSLContainerInfo.h"
 #include "Support/DaemonProcess.h"
+#include "Support/RootFiles.h"
 
 namespace vsl::test {
 
@@ -16,7 +17,6 @@ extern const char* const kAllowedEntitlement;
 extern const char* const kTestabilityEntitlement;
 
 // Writes a file below the daemon's root, making its directory.
-void writeRootFile(const DaemonProcess& daemon, const std::string& relative, const std::string& bytes);
 void writeDeviceFacts(const DaemonProcess& daemon, const Value& facts);
 // Registers this test program with the general and the testability entitlement.
 void registerSelf(const DaemonProcess& daemon);

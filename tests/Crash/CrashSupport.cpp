@@ -1,6 +1,5 @@
 #include "Crash/CrashSupport.h"
 
-#include <dirent.h>
 
 #include <fstream>
 #include <set>
@@ -87,18 +86,6 @@ DaemonProcess::CtlResult destroyDeathRow(const DaemonProcess& d) {
 std::string replyPath(const DaemonProcess::CtlResult& r) {
     const Value* v = r.reply.find("ReplyPath");
     return v && v->stringValue() ? *v->stringValue() : std::string();
-}
-
-std::vector<std::string> entriesOf(const std::string& directory) {
-    std::vector<std::string> names;
-    DIR* dir = ::opendir(directory.c_str());
-    if (!dir) return names;
-    while (dirent* e = ::readdir(dir)) {
-        std::string name = e->d_name;
-        if (name != "." && name != "..") names.push_back(name);
-    }
-    ::closedir(dir);
-    return names;
 }
 
 }  // namespace vsl::test

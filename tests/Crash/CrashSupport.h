@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "Support/DaemonProcess.h"
+#include "Support/RootFiles.h"
 
 namespace vsl::test {
 
@@ -34,7 +35,5 @@ DaemonProcess::CtlResult deleteContainer(const DaemonProcess& d, const std::stri
 DaemonProcess::CtlResult destroyDeathRow(const DaemonProcess& d);
 
 std::string replyPath(const DaemonProcess::CtlResult& r);
-// The entries of a directory but "." and ".."; empty when it cannot be read.
-std::vector<std::string> entriesOf(const std::string& directory);
 
 }  // namespace vsl::test

@@ -2,7 +2,11 @@
 
 #include <syslog.h>
 
+#include <unistd.h>
+
+#include <cstdio>
 #include <cstdlib>
+#include <string>
 
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/Concurrency/VSLDataProtectionManager.h"
@@ -10,6 +14,7 @@
 #include "Daemon/Service/VSLCommandTable.h"
 #include "Daemon/Service/VSLLockState.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
+#include "Daemon/Upcall/VSLUpcallServer.h"
 #include "Platform/CrashAnnotation.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
@@ -69,6 +74,13 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     if (!VSLDataProtectionManager::defaultManager().restartPendingDataProtectionOperationsWithError(&protectionError))
         LogWrite(kLogLevelError, "vesseld_init", "Failed restarting pending data protection operations: %@",
                  protectionError);
+    std::string upcallError;
+    if (!startKernelUpcallServer(&upcallError)) {
+        LogWrite(kLogLevelError, "vesseld_init", "Failed to initialize kernel upcall interface.");
+        std::fprintf(stderr, "vesseld: Failed to initialize kernel upcall interface: %s\n", upcallError.c_str());
+        closeLogFile();
+        ::_exit(1);
+    }
 
     // Every start: whatever a crash left on death row is destroyed in the background.
     VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);

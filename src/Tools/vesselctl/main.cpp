@@ -9,10 +9,12 @@
 #include "Client/VSLArguments.h"
 #include "Client/VSLConnection.h"
 #include "Client/VSLProtocol.h"
+#include "Client/VSLUpcallClient.h"
 #include "Platform/PropertyList.h"
 #include "ContentSubcommands.h"
 #include "Keybag.h"
 #include "Subcommands.h"
+#include "Upcall.h"
 
 using namespace vsl;
 using namespace vsl::client;
@@ -33,7 +35,8 @@ int usage(FILE* out) {
                  "\n"
                  "commands:\n");
     for (uint64_t i = 0; i < kVSLProtocolCommandCount; i++) std::fprintf(out, "  %2llu  %s\n", (unsigned long long)i, commandName(i));
-    std::fprintf(out, "\nsubcommands:\n%s%s%s", kSubcommandUsage, kGroupSubcommandUsage, kContentSubcommandUsage);
+    std::fprintf(out, "\nsubcommands:\n%s%s%s%s", kSubcommandUsage, kGroupSubcommandUsage, kContentSubcommandUsage,
+                 kUpcallUsage);
     std::fprintf(out,
                  "\n"
                  "replace (replaceContainer): puts a prepared container in the place of an old one\n"
@@ -74,6 +77,10 @@ int main(int argc, char** argv) {
         }
     }
     if (i >= argc) return usage(stderr);
+    if (std::string(argv[i]) == "upcall") {
+        if (socketPath.empty()) socketPath = VSLUpcallClient::socketPathForSystemRoot(root);
+        return runUpcallSubcommand(socketPath, asJson, timeoutSeconds, argc, argv, i + 1);
+    }
 
     if (std::string(argv[i]) == "keybag") return runKeybagCommand(root, argc - i, argv + i, asJson);
 

@@ -18,6 +18,7 @@
 
 #include "Daemon/Service/VSLService.h"
 #include "Daemon/Service/VSLStartup.h"
+#include "Daemon/Upcall/VSLUpcallServer.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
 #include "Platform/SystemRoot.h"
@@ -122,7 +123,8 @@ int main(int argc, char** argv) {
 
     // A handler blocked on a slow disk or a FIFO must not keep the daemon alive: past
     // the grace periods, exit under whatever still runs rather than tear it down.
-    const bool handlersDone = service->stop(kHandlerGrace);
+    const bool upcallsDone = stopKernelUpcallServer(kHandlerGrace);
+    const bool handlersDone = service->stop(kHandlerGrace) && upcallsDone;
     if (!handlersDone) LogWrite(kLogLevelNotice, "main", "Stopping with request handlers still running");
     const bool transactionsDone = waitForNoTransactions(kTransactionGrace);
     if (!transactionsDone)
