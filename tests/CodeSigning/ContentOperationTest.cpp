@@ -24,6 +24,9 @@ class ContentOperation : public CodeSigningTest {
 protected:
     void SetUp() override {
         CodeSigningTest::SetUp();
+        // Only now: the user's home comes from the test's own system root.
+        user = VSLUserIdentityCache::userIdentityForLegacyMobileUser();
+        privileged = VSLClientConnection::createPrivileged();
         VSLContainerCache::sharedInstance()->invalidateUserIdentity(user);
         // Built now, from empty class directories: later adds go into these indexes.
         VSLErrorRef error;
@@ -56,8 +59,8 @@ protected:
         return out;
     }
 
-    VSLUserIdentityRef user = VSLUserIdentityCache::userIdentityForLegacyMobileUser();
-    VSLClientConnectionRef privileged = VSLClientConnection::createPrivileged();
+    VSLUserIdentityRef user;
+    VSLClientConnectionRef privileged;
 };
 
 }  // namespace
