@@ -44,6 +44,7 @@ std::shared_ptr<VSLCodeSigningMapping> VSLCodeSigningMapping::sharedInstance() {
         return nullptr;
     }
     gShared = create(std::move(database), VSLUserIdentitySharedCache::sharedInstance());
+    gShared->migrateFromMappingFileToDBIfNecessary();
     return gShared;
 }
 

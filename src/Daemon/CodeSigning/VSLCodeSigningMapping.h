@@ -33,6 +33,7 @@
 namespace vsl {
 
 class VSLUserIdentityCache;
+class VSLMetadata;
 
 // Entitlement keys read from an identifier's entitlements.
 extern const char* const kVSLApplicationGroupsEntitlement;      // "com.tarrow.security.application-groups"
@@ -109,6 +110,21 @@ public:
     uint64_t invalidateCodeSigningInfoForAppsWithoutBundleContainer();
     bool removeAllAdvanceCopiesWithError(VSLErrorRef* error);
 
+    // ---- imports of what older builds kept outside the database ----
+
+    // The file-based store, on the queue; made by sharedInstance when it opens the
+    // database. The file goes once at least one entry was stored.
+    void migrateFromMappingFileToDBIfNecessary();
+    // Takes the global write lock: the group identifiers of the legacy mobile user's
+    // data containers and the reconciliation of application groups (both not in
+    // multi-user mode), the legacy entitlements file and the bundle containers'
+    // cached information. Stagings are queued on `commandQueue` with locking, for the
+    // caller to drain after the lock is released.
+    void performAllCodeSigningMigrationAndReconciliationWithCommandQueue(
+        const std::shared_ptr<VSLCommandQueue>& commandQueue);
+    void migrateAppGroupIdsFromDataContainersToFile();
+    void migrateCachedCodeSigningInfoFromBundleContainersToMapping();
+
     // ---- group references ----
 
     VSLCountedSet copyReferenceCountSetOfType(VSLGroupType type);
@@ -123,6 +139,14 @@ public:
 
 private:
     void assertOnQueue() const;
+    std::optional<std::vector<std::pair<std::string, VSLCodeSigningEntry>>> _readCodeSigningMappingFromDiskAtURL(
+        const std::string& path);
+    void _onQueue_migrateFromMappingFileToDBIfNecessary();
+    void _onQueue_migrateDataFromLegacyEntitlementsFileToCodeSigningFile();
+    void _onQueue_migrateAppGroupIdsFromDataContainersToFileUsingContainers(
+        const std::vector<std::shared_ptr<const VSLMetadata>>& containers);
+    void _onQueue_migrateCachedCodeSigningInfoFromBundleContainersToMappingWithContainers(
+        const std::vector<std::shared_ptr<const VSLMetadata>>& containers, VSLContainerClass containerClass);
     // Stored entry; not found is none without a log, other errors are logged.
     std::optional<VSLCodeSigningEntry> _onQueue_codeSigningEntryForIdentifier(const std::string& identifier,
                                                                               VSLErrorRef* error);

@@ -3,6 +3,7 @@
 #include "Client/VSLProtocol.h"
 #include "Daemon/CodeSigning/VSLCodeSigningHandlers.h"
 #include "Daemon/Core/VSLErrorCodes.h"
+#include "Daemon/Migration/VSLMigrationHandlers.h"
 #include "Daemon/Service/VSLContainerHandlers.h"
 #include "Daemon/Service/VSLContentHandlers.h"
 #include "Daemon/Service/VSLEntitlements.h"
@@ -48,7 +49,7 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {21, handleSetDataProtection, A, 0x0},
     {22, handleRecreateDefaultStructure, A, 0x1},
     {23, handleDiskUsage, A, 0x10001},
-    {24, nullptr, kVSLEntitlementDataMigration, 0x1},
+    {24, handlePerformDataMigration, kVSLEntitlementDataMigration, 0x1},
     {25, handleRetryTest, kVSLEntitlementTestability, 0x1},
     {26, handleStageSharedContent, kVSLEntitlementStageSharedContent, 0x1},
     {27, retiredCommand, A, 0x1},
