@@ -23,10 +23,23 @@ public:
     bool performDataMigratorMigrationForClientConnection(const VSLClientConnectionRef& connection,
                                                          VSLErrorRef* error);
 
+    // Skeleton directories of every user's containers (once), the protection class of
+    // data containers whose application has no bundle container, and the removal of
+    // retired containers.
+    bool performPerUserDataMigrationForClientConnection(const VSLClientConnectionRef& connection, VSLErrorRef* error);
+
+    // Class 2: the application's bundle container; class 4: its parent's.
+    VSLMetadataRef _bundleContainerForDataContainer(const VSLMetadata& container, VSLErrorRef* error);
+    void _setDataProtectionIfNecessaryOnContainer(const VSLMetadata& container);
+
     bool _performInternalACLMigrationWithError(VSLMigrationStatus& status, VSLErrorRef* error);
     bool _performBundleContainerOwnershipMigrationWithError(VSLMigrationStatus& status, VSLErrorRef* error);
 
 private:
+    bool subdirectoryMigration();
+    bool dataProtectionMigration();
+    void removeDeprecatedContainers(const VSLClientConnectionRef& connection);
+
     std::shared_ptr<VSLUserIdentityCache> userIdentityCache_;
 };
 

@@ -15,4 +15,13 @@ void handlePerformDataMigration(const Value&, const VSLReplyRef&, const VSLClien
     *code = codeForError(error, kVSLErrorException);
 }
 
+void handlePerformPerUserDataMigration(const Value&, const VSLReplyRef&, const VSLClientConnectionRef& connection,
+                                       uint64_t* code) {
+    VSLErrorRef error;
+    if (VSLContainerMigrator::sharedInstance()->performPerUserDataMigrationForClientConnection(connection, &error))
+        return;
+    LogWrite(kLogLevelError, VSL_FUNCTION, "Failed to perform per-user data migration : %@", error);
+    *code = codeForError(error, kVSLErrorException);
+}
+
 }  // namespace vsl

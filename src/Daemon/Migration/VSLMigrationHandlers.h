@@ -8,4 +8,7 @@ namespace vsl {
 void handlePerformDataMigration(const Value& request, const VSLReplyRef& reply,
                                 const VSLClientConnectionRef& connection, uint64_t* code);
 
+void handlePerformPerUserDataMigration(const Value& request, const VSLReplyRef& reply,
+                                       const VSLClientConnectionRef& connection, uint64_t* code);
+
 }  // namespace vsl

@@ -55,7 +55,7 @@ const VSLCommandRow kCommands[kVSLCommandCount] = {
     {27, retiredCommand, A, 0x1},
     {28, handleUserManagedAssetsPath, kVSLEntitlementUserManagedAssets, 0x101},
     {29, handleDeleteUserManagedAsset, kVSLEntitlementUserManagedAssets, 0x1},
-    {30, nullptr, kVSLEntitlementDataMigration, 0x1},
+    {30, handlePerformPerUserDataMigration, kVSLEntitlementDataMigration, 0x1},
     {31, handleSetTestLock, kVSLEntitlementTestability, 0x1},
     {32, listAccessiblePersonas, A, 0x10101},
 };
