@@ -13,6 +13,7 @@
 #include "Daemon/Migration/VSLMigrationStatus.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Storage/VSLContainerCache.h"
+#include "Daemon/Storage/VSLMetadata.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/DurableIO.h"
@@ -50,6 +51,17 @@ std::optional<std::vector<std::string>> stringList(const Value* value) {
     for (const Value& v : *array)
         if (const std::string* s = v.stringValue()) list.push_back(*s);
     return list;
+}
+
+const Value* infoValue(const VSLMetadata& container, const char* key) {
+    return container.info() ? container.info()->find(key) : nullptr;
+}
+
+// Without locking: the caller holds the global write lock. 1 or the failure's code.
+uint64_t clearInfoValue(VSLClientConnection& connection, const VSLMetadata& container, const char* key) {
+    uint64_t code = kVSLSuccess;
+    connection.setInfoValue(std::nullopt, Value::string(key), container.containerIdentity(), false, &code);
+    return code;
 }
 
 VSLContainerClass dataClassForBundleClass(VSLContainerClass bundleClass) {
@@ -187,11 +199,9 @@ void VSLCodeSigningMapping::migrateAppGroupIdsFromDataContainersToFile() {
         }
         queue_->sync([&] { _onQueue_migrateAppGroupIdsFromDataContainersToFileUsingContainers(*containers); });
         for (const auto& container : *containers) {
-            const Value* groups = container->info() ? container->info()->find(kGroupContainerIdsKey) : nullptr;
-            if (!groups) continue;
-            uint64_t code = kVSLSuccess;
-            if (!connection->setInfoValue(std::nullopt, Value::string(kGroupContainerIdsKey),
-                                          container->containerIdentity(), false, &code))
+            if (!infoValue(*container, kGroupContainerIdsKey)) continue;
+            uint64_t code = clearInfoValue(*connection, *container, kGroupContainerIdsKey);
+            if (code != kVSLSuccess)
                 LogWrite(kLogLevelError, VSL_FUNCTION, "Failed to clear group id metadata for %@ : %llu",
                          container->identifier(), static_cast<unsigned long long>(code));
         }
@@ -203,7 +213,7 @@ void VSLCodeSigningMapping::_onQueue_migrateAppGroupIdsFromDataContainersToFileU
     const std::vector<VSLMetadataRef>& containers) {
     assertOnQueue();
     for (const auto& container : containers) {
-        const Value* groups = container->info() ? container->info()->find(kGroupContainerIdsKey) : nullptr;
+        const Value* groups = infoValue(*container, kGroupContainerIdsKey);
         if (!groups) continue;
         const std::string& identifier = container->identifier();
         osLog(LogCategory::CodeSignMapping, OSLogLevel::Debug,
@@ -255,11 +265,10 @@ void VSLCodeSigningMapping::migrateCachedCodeSigningInfoFromBundleContainersToMa
                                                                                              containerClass);
         });
         for (const auto& container : *containers) {
-            const Value* cached = container->info() ? container->info()->find(kVSLCachedCodeSigningInfoKey) : nullptr;
+            const Value* cached = infoValue(*container, kVSLCachedCodeSigningInfoKey);
             if (!cached || !cached->isDictionary()) continue;
-            uint64_t code = kVSLSuccess;
-            if (!connection->setInfoValue(std::nullopt, Value::string(kVSLCachedCodeSigningInfoKey),
-                                          container->containerIdentity(), false, &code))
+            uint64_t code = clearInfoValue(*connection, *container, kVSLCachedCodeSigningInfoKey);
+            if (code != kVSLSuccess)
                 LogWrite(kLogLevelError, VSL_FUNCTION, "Error setting info value for identity %@ : %llu",
                          container->containerIdentity(), static_cast<unsigned long long>(code));
         }
@@ -271,7 +280,7 @@ void VSLCodeSigningMapping::_onQueue_migrateCachedCodeSigningInfoFromBundleConta
     const std::vector<VSLMetadataRef>& containers, VSLContainerClass containerClass) {
     assertOnQueue();
     for (const auto& container : containers) {
-        const Value* cached = container->info() ? container->info()->find(kVSLCachedCodeSigningInfoKey) : nullptr;
+        const Value* cached = infoValue(*container, kVSLCachedCodeSigningInfoKey);
         if (!cached || !cached->isDictionary()) continue;
         const std::string& identifier = container->identifier();
         VSLErrorRef lookupError;
