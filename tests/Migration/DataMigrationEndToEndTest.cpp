@@ -110,7 +110,7 @@ TEST_F(DataMigration, ImportsLegacyFilesStagesUnreferencedGroupsAndChangesNothin
     EXPECT_EQ(55u, daemon.run(stranger, {"performDataMigration"}).code());
     EXPECT_TRUE(exists(daemon.at(std::string(kLibrary) + "vsl_entitlements.plist"))) << "refused: nothing ran";
 
-    r = daemon.run(migrator, {"performDataMigration"});
+    r = daemon.run(migrator, {"migrate"});
     ASSERT_EQ(1u, r.code()) << r.err << readFile(daemon.at("vesseld.stderr"));
     EXPECT_FALSE(exists(daemon.at(std::string(kLibrary) + "vsl_entitlements.plist")));
 

@@ -68,7 +68,7 @@ TEST(PerUserMigration, RestoresSkeletonsOnceRemovesRetiredContainersAndIsRefused
     EXPECT_FALSE(isDirectory(appPath + "/Documents")) << "refused: nothing ran";
     EXPECT_EQ(1u, lookup("com.tarrow.Almanac", 2, false).code());
 
-    auto r = daemon.run(migrator, {"performPerUserDataMigration"});
+    auto r = daemon.run(migrator, {"migrate-user"});
     ASSERT_EQ(1u, r.code()) << r.err << readFile(daemon.at("vesseld.stderr"));
     EXPECT_TRUE(isDirectory(appPath + "/Documents"));
     EXPECT_EQ(21u, lookup("com.tarrow.Almanac", 2, false).code());
@@ -81,7 +81,7 @@ TEST(PerUserMigration, RestoresSkeletonsOnceRemovesRetiredContainersAndIsRefused
     // Recorded: the skeleton pass does not run again; the retired containers, absent
     // now, are not reported.
     ASSERT_EQ(0, ::rmdir((appPath + "/Documents").c_str()));
-    r = daemon.run(migrator, {"performPerUserDataMigration"});
+    r = daemon.run(migrator, {"migrate-user"});
     ASSERT_EQ(1u, r.code()) << r.err;
     EXPECT_FALSE(isDirectory(appPath + "/Documents"));
     EXPECT_EQ(std::string::npos, readFile(daemon.at("vesseld.stderr")).find("Could not delete deprecated container"));

@@ -2,6 +2,8 @@
 
 #include "ContentSubcommands.h"
 
+#include "Client/VSLProtocol.h"
+
 #include <cstdlib>
 #include <cstring>
 
@@ -12,6 +14,7 @@ const char* const kSubcommandUsage =
     "  info get KEY | info set KEY [Value[:type]=V]   (with Identifier= ContainerClass= UUID=)\n"
     "  metadata | recreate-structure | regenerate-uuid | du   (with the same keys)\n"
     "  test-lock N on|off | retry-test N\n"
+    "  migrate | migrate-user   (data migration; per-user migration)\n"
     "  protect CLASS   (with Identifier= [ContainerClass=2] [RetryIfLocked=true] [IsThirdParty=true])\n"
     "  keybag lock|unlock|state   (the device lock state of the root; no daemon needed)\n";
 
@@ -59,6 +62,10 @@ std::optional<Dictionary> subcommandRequest(int argc, char** argv, int* index, s
         request = command(9);
     } else if (word == "du") {
         request = command(23);
+    } else if (word == "migrate") {
+        request = command(*commandNumberForName("performDataMigration"));
+    } else if (word == "migrate-user") {
+        request = command(*commandNumberForName("performPerUserDataMigration"));
     } else if (word == "test-lock") {
         if (!need(2, "test-lock N on|off")) return Dictionary{};
         auto lock = number(argv[i + 1]);
