@@ -22,7 +22,7 @@ VSLTestLocks& VSLTestLocks::sharedInstance() {
 
 VSLTestLocks::VSLTestLocks() : stateQueue_(WorkQueue::serial("com.tarrow.vesseld.VSLTestLocks.stateQueue")) {
     for (uint64_t i = 2; i < kLockCount; i++) {
-        gates_[i] = std::make_unique<Gate>();
+        gates_[i] = std::make_shared<Gate>();
         gates_[i]->queue = WorkQueue::concurrent("com.tarrow.vesseld.VSLTestLocks.lockQueue");
     }
 }
@@ -88,7 +88,9 @@ void VSLTestLocks::_stateQueue_acquireLock(uint64_t lock) {
         holders_[lock] = std::move(holder);
         return;
     }
-    Gate* gate = gates_[lock].get();
+    // The barrier item owns the gate too: it may still be waking waiters when the
+    // locks object goes away (tests make their own).
+    std::shared_ptr<Gate> gate = gates_[lock];
     {
         std::lock_guard<std::mutex> g(gate->mutex);
         gate->barriers++;

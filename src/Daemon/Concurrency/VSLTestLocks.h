@@ -70,7 +70,7 @@ private:
     };
 
     int64_t counts_[kLockCount] = {};
-    std::unique_ptr<Gate> gates_[kLockCount];
+    std::shared_ptr<Gate> gates_[kLockCount];
     std::unique_ptr<Holder> holders_[2];
     mutable std::mutex enabledMutex_;
     bool enabled_ = false;
