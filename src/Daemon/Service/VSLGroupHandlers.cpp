@@ -37,10 +37,7 @@ VSLUserIdentityRef groupOwnerUserIdentity(VSLClientConnection& connection, const
         return nullptr;
     }
     if (!own->isNoSpecificPersona()) return own;
-    std::string bundleIdentifier = owner;
-    auto mapping = VSLCodeSigningMapping::sharedInstance();
-    if (auto parent = mapping ? mapping->parentIdentifierForChildIdentifier(owner) : std::nullopt)
-        bundleIdentifier = *parent;
+    std::string bundleIdentifier = installedBundleIdentifier(owner);
     size_t installed = 0;
     std::string listed;
     auto chosen = chooseInstalledUserIdentity(connection, bundleIdentifier, &installed, &listed);

@@ -87,12 +87,8 @@ VSLUserIdentityRef userIdentityForContainerIdentifier(VSLClientConnection& conne
     }
     if (!isPerUserContainerClass(containerClass) || !own->isNoSpecificPersona()) return own;
 
-    std::string bundleIdentifier = identifier;
-    if (isChildDataContainerClass(containerClass)) {
-        auto mapping = VSLCodeSigningMapping::sharedInstance();
-        if (auto parent = mapping ? mapping->parentIdentifierForChildIdentifier(identifier) : std::nullopt)
-            bundleIdentifier = *parent;
-    }
+    std::string bundleIdentifier =
+        isChildDataContainerClass(containerClass) ? installedBundleIdentifier(identifier) : identifier;
     size_t installed = 0;
     std::string listed;
     auto chosen = chooseInstalledUserIdentity(connection, bundleIdentifier, &installed, &listed);
@@ -104,6 +100,12 @@ VSLUserIdentityRef userIdentityForContainerIdentifier(VSLClientConnection& conne
     LogWrite(kLogLevelError, "userIdentityForContainerIdentifier", "%@ trying to look up persona for %llu:%@",
              connection.clientIdentity(), containerClass, identifier);
     return own;
+}
+
+std::string installedBundleIdentifier(const std::string& identifier) {
+    auto mapping = VSLCodeSigningMapping::sharedInstance();
+    auto parent = mapping ? mapping->parentIdentifierForChildIdentifier(identifier) : std::nullopt;
+    return parent.value_or(identifier);
 }
 
 VSLUserIdentityRef chooseInstalledUserIdentity(VSLClientConnection& connection, const std::string& bundleIdentifier,

@@ -37,6 +37,9 @@ VSLUserIdentityRef userIdentityForPersonaUniqueString(const std::optional<std::s
 VSLUserIdentityRef userIdentityForContainerIdentifier(VSLClientConnection& connection, const std::string& identifier,
                                                       VSLContainerClass containerClass, uint64_t* code);
 
+// The identifier whose installation decides a persona: a child's parent where the
+// code-signing information names one, else `identifier` itself.
+std::string installedBundleIdentifier(const std::string& identifier);
 // Among the personas `bundleIdentifier` is installed in: the only one, or the
 // client's own when it is one of several. None when there is none (`*installed` is
 // 0) or when several exclude the client's (logged as ambiguous). `listed` names them.
