@@ -149,7 +149,7 @@ void VSLCodeSigningMapping::_onQueue_removeGroupContainersIfNeededforUserIdentit
             auto identity = VSLContainerIdentity::containerIdentityWithUserIdentity(userIdentity, group,
                                                                                     groupContainerClass, &code);
             if (identity && commandQueue) {
-                commandQueue->insertCommand(VSLCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+                commandQueue->insertCommand(VSLCommandStageForDelete::commandForStageForDeleteOfUnreferencedGroups(
                     {identity}, true, [group, userIdentity](uint64_t failure) {
                         osLog(LogCategory::CodeSignMapping, OSLogLevel::Error,
                               "Failed to destroy group container with identifier %@ for %@: %llu", group, userIdentity,

@@ -106,7 +106,7 @@ void VSLGroupManager::_cleanupUnreferencedGroupContainersForUserIdentity(
               userIdentity, container->url());
         if (!commandQueue) continue;
         // With locking: the queue is drained after the caller's write lock is released.
-        commandQueue->insertCommand(VSLCommandStageForDelete::commandForStageForDeleteWithContainerIdentities(
+        commandQueue->insertCommand(VSLCommandStageForDelete::commandForStageForDeleteOfUnreferencedGroups(
             {container->containerIdentity()}, true, [group, userIdentity](uint64_t failure) {
                 osLog(LogCategory::CodeSignMapping, OSLogLevel::Error,
                       "Failed to destroy group container with identifier %@ for %@: %llu", group, userIdentity,

@@ -7,6 +7,7 @@
 #include "Daemon/CodeSigning/VSLSQLiteStatement.h"
 #include "Daemon/CodeSigning/VSLSQLiteTransaction.h"
 #include "Daemon/Core/VSLExceptionGuard.h"
+#include "Daemon/Core/VSLInjectedFaults.h"
 #include "Daemon/Core/VSLInvariant.h"
 #include "Platform/Log.h"
 #include "Platform/PropertyList.h"
@@ -226,6 +227,9 @@ bool VSLSQLiteDB::addCodeSigningEntry(const VSLCodeSigningEntry* entry, const st
         return failWithError(error,
                              VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true,
                                        "codeSigningEntry %@ and identifier %@ cannot be nil", entry, identifier));
+    if (databaseWriteFailureInjectedFor(*identifier))
+        return failWithError(error, VSL_ERROR(kVSLErrorDatabase, nullptr, true, "Injected write failure for %@",
+                                              *identifier));
     VSLSQLiteTransaction transaction(db_, url_, VSL_FUNCTION);
     try {
         if (!transaction.begin(error)) return false;

@@ -2,6 +2,7 @@
 
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/Concurrency/VSLLocks.h"
+#include "Daemon/Concurrency/VSLTestLocks.h"
 #include "Daemon/Core/VSLExceptionGuard.h"
 #include "Daemon/Storage/VSLContainerCache.h"
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
@@ -49,9 +50,35 @@ std::shared_ptr<VSLCommandStageForDelete> VSLCommandStageForDelete::commandForSt
     return std::make_shared<VSLCommandStageForDelete>(std::move(containerIdentities), useLocking, std::move(onError));
 }
 
+std::shared_ptr<VSLCommandStageForDelete> VSLCommandStageForDelete::commandForStageForDeleteOfUnreferencedGroups(
+    std::vector<VSLContainerIdentityRef> containerIdentities, bool useLocking, OnError onError) {
+    return std::make_shared<VSLCommandStageForDelete>(std::move(containerIdentities), useLocking, std::move(onError),
+                                                      true);
+}
+
 VSLCommandStageForDelete::VSLCommandStageForDelete(std::vector<VSLContainerIdentityRef> containerIdentities,
-                                                   bool useLocking, OnError onError)
-    : useLocking_(useLocking), containerIdentities_(std::move(containerIdentities)), onError_(std::move(onError)) {}
+                                                   bool useLocking, OnError onError, bool onlyUnreferencedGroups)
+    : useLocking_(useLocking),
+      onlyUnreferencedGroups_(onlyUnreferencedGroups),
+      containerIdentities_(std::move(containerIdentities)),
+      onError_(std::move(onError)) {}
+
+// Runs under the global write lock, which registrations do not take: one that lands
+// after this count is ordered after the staging, since nothing can look the group
+// up before the lock is released.
+bool VSLCommandStageForDelete::groupIsNamedAgain(const VSLMetadata& container) const {
+    if (!onlyUnreferencedGroups_ || !isGroupContainerClass(container.containerClass())) return false;
+    auto mapping = VSLCodeSigningMapping::sharedInstance();
+    if (!mapping) return false;
+    const VSLCountedSet counts =
+        mapping->copyReferenceCountSetOfType(containerClassTraits(container.containerClass()).groupType);
+    auto counted = counts.find(container.identifier());
+    if (counted == counts.end() || counted->second == 0) return false;
+    osLog(LogCategory::CodeSignMapping, OSLogLevel::Default,
+          "Keeping group container %@ for %@: named again since it was queued for deletion", container.identifier(),
+          container.userIdentity());
+    return true;
+}
 
 bool VSLCommandStageForDelete::stageAll(const std::shared_ptr<VSLCommandQueue>& queue, VSLErrorRef* pending) {
     const auto& cache = VSLContainerCache::sharedInstance();
@@ -69,7 +96,7 @@ bool VSLCommandStageForDelete::stageAll(const std::shared_ptr<VSLCommandQueue>& 
             container = cache->containerForContainerIdentity(identity, false, true, &lookupError);
             if (!container) *pending = lookupError;
         }
-        if (!container) continue;
+        if (!container || groupIsNamedAgain(*container)) continue;
 
         std::string destination = deathrow + "/" + lastPathComponent(container->url());
         if (isBundleContainerClass(container->containerClass()) &&
@@ -105,6 +132,7 @@ bool VSLCommandStageForDelete::stageAll(const std::shared_ptr<VSLCommandQueue>& 
 }
 
 bool VSLCommandStageForDelete::fromQueue(const std::shared_ptr<VSLCommandQueue>& queue, uint64_t* code) {
+    VSLTestLocks::sharedInstance().waitOnLock(VSLTestLocks::kDeathRowGate);
     VSLErrorRef pending;
     bool ok = false;
     {

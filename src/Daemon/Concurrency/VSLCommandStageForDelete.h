@@ -15,6 +15,8 @@
 
 namespace vsl {
 
+class VSLMetadata;
+
 class VSLCommandStageForDelete : public VSLCommand {
 public:
     // Told the code of the error the run ends with.
@@ -24,8 +26,12 @@ public:
     // must already hold the global write lock when the command runs.
     static std::shared_ptr<VSLCommandStageForDelete> commandForStageForDeleteWithContainerIdentities(
         std::vector<VSLContainerIdentityRef> containerIdentities, bool useLocking, OnError onError);
+    // Group containers staged because nothing named them: each is kept if a
+    // registration has named its group again by the time the command runs.
+    static std::shared_ptr<VSLCommandStageForDelete> commandForStageForDeleteOfUnreferencedGroups(
+        std::vector<VSLContainerIdentityRef> containerIdentities, bool useLocking, OnError onError);
     VSLCommandStageForDelete(std::vector<VSLContainerIdentityRef> containerIdentities, bool useLocking,
-                             OnError onError);
+                             OnError onError, bool onlyUnreferencedGroups = false);
 
     // The client command stageContainerForDelete.
     static constexpr uint64_t kCommandNumber = 3;
@@ -41,8 +47,10 @@ public:
 
 private:
     bool stageAll(const std::shared_ptr<VSLCommandQueue>& queue, VSLErrorRef* pending);
+    bool groupIsNamedAgain(const VSLMetadata& container) const;
 
     bool useLocking_;
+    bool onlyUnreferencedGroups_;
     std::vector<VSLContainerIdentityRef> containerIdentities_;
     OnError onError_;
 };

@@ -3,8 +3,8 @@
 // through (waitOnLock), to freeze the daemon at a known point. Gates:
 //   2 disk usage, before measuring;  3 create, staged container complete, before the
 //   move into place;  4 replacement, after the old container is staged;
-//   5 protection-class walk, before the first item;  6 death-row destruction, before
-//   each item.
+//   5 protection-class walk, before the first item;  6 death row: a staging, before
+//   it takes the global lock, and destruction, before each item.
 // Counts change only on the serial state queue; the command keeps acquisitions and
 // releases balanced, and an update that would take a count below 0 stops the process.
 #pragma once

@@ -10,4 +10,12 @@ namespace vsl {
 // that identifier fails after its staging directory was made.
 bool creationFailureInjectedFor(const std::string& identifier);
 
+#ifdef VESSEL_KILLPOINTS
+// VESSELD_TEST_FAIL_DB_WRITES=ID[,ID...]: the code-signing database refuses every
+// write of those identifiers' entries; "*" refuses every write.
+bool databaseWriteFailureInjectedFor(const std::string& identifier);
+#else
+inline bool databaseWriteFailureInjectedFor(const std::string&) { return false; }
+#endif
+
 }  // namespace vsl
