@@ -27,11 +27,16 @@ std::string decideSocketPath() {
     return "/run/systemd/journal/socket";
 }
 
+bool isSet(const char* name) {
+    const char* value = std::getenv(name);
+    return value && *value;
+}
+
 bool startedByServiceManager() {
 #ifdef VESSEL_KILLPOINTS
-    if (const char* test = std::getenv("VESSELD_TEST_JOURNAL_SOCKET"); test && *test) return true;
+    if (isSet("VESSELD_TEST_JOURNAL_SOCKET")) return true;
 #endif
-    return std::getenv("INVOCATION_ID") || std::getenv("JOURNAL_STREAM");
+    return isSet("INVOCATION_ID") || isSet("JOURNAL_STREAM");
 }
 
 // NAME=value, or, for a value holding a newline, NAME, a newline, the value's length as

@@ -1,11 +1,7 @@
 // Under the service manager every entry of the rotating log also reaches the journal,
 // with the fields an operator filters on. The journal here is a double: a datagram
 // socket the test binds, which the daemon's test build sends to instead.
-#include <sys/socket.h>
-#include <sys/un.h>
-
 #include <chrono>
-#include <cstring>
 #include <map>
 #include <optional>
 #include <string>
@@ -15,10 +11,10 @@
 #include <gtest/gtest.h>
 
 #include "Daemon/Core/VSLErrorCodes.h"
-#include "Platform/UniqueFd.h"
 #include "Platform/Value.h"
 #include "Support/DaemonProcess.h"
 #include "Support/TempRoot.h"
+#include "Systemd/DatagramListener.h"
 
 namespace vsl::test {
 namespace {
@@ -52,22 +48,11 @@ Entry parseEntry(const std::string& datagram) {
 
 class JournalDouble {
 public:
-    explicit JournalDouble(const std::string& path) {
-        fd_.reset(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-        sockaddr_un addr{};
-        addr.sun_family = AF_UNIX;
-        std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-        bound_ = ::bind(fd_.get(), reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
-    }
-    bool bound() const { return bound_; }
+    explicit JournalDouble(const std::string& path) : listener_(path) {}
+    bool bound() const { return listener_.bound(); }
     // The entries received so far.
     const std::vector<Entry>& entries() {
-        char buf[1 << 16];
-        for (;;) {
-            const ssize_t n = ::recv(fd_.get(), buf, sizeof buf, 0);
-            if (n <= 0) break;
-            entries_.push_back(parseEntry(std::string(buf, static_cast<size_t>(n))));
-        }
+        for (const auto& datagram : listener_.receive()) entries_.push_back(parseEntry(datagram));
         return entries_;
     }
     // The first entry whose message holds `text`, waiting a while for it.
@@ -84,8 +69,7 @@ public:
     }
 
 private:
-    UniqueFd fd_;
-    bool bound_ = false;
+    DatagramListener listener_;
     std::vector<Entry> entries_;
 };
 

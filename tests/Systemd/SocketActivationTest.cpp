@@ -22,6 +22,7 @@
 #include "Platform/UniqueFd.h"
 #include "Support/DaemonProcess.h"
 #include "Support/TempRoot.h"
+#include "Systemd/DatagramListener.h"
 
 namespace vsl::test {
 namespace {
@@ -31,24 +32,13 @@ const char* const kActivator = "/usr/bin/systemd-socket-activate";
 // The notification socket a service manager would listen on.
 class NotifySocket {
 public:
-    explicit NotifySocket(const std::string& path) : path_(path) {
-        fd_.reset(::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC | SOCK_NONBLOCK, 0));
-        sockaddr_un addr{};
-        addr.sun_family = AF_UNIX;
-        std::strncpy(addr.sun_path, path.c_str(), sizeof addr.sun_path - 1);
-        bound_ = ::bind(fd_.get(), reinterpret_cast<sockaddr*>(&addr), sizeof addr) == 0;
-    }
-    bool bound() const { return bound_; }
+    explicit NotifySocket(const std::string& path) : listener_(path) {}
+    bool bound() const { return listener_.bound(); }
     // Every notification that has arrived so far, one per line.
     std::string drain() {
         std::string all;
-        char buf[4096];
-        for (;;) {
-            const ssize_t n = ::recv(fd_.get(), buf, sizeof buf, 0);
-            if (n <= 0) return all;
-            all.append(buf, static_cast<size_t>(n));
-            all += '\n';
-        }
+        for (const auto& message : listener_.receive()) all += message + "\n";
+        return all;
     }
     // Waits until a notification holding `text` arrives; everything seen on the way is kept.
     bool waitFor(const std::string& text, std::chrono::seconds limit) {
@@ -62,9 +52,7 @@ public:
     }
 
 private:
-    std::string path_;
-    UniqueFd fd_;
-    bool bound_ = false;
+    DatagramListener listener_;
     std::string seen_;
 };
 
