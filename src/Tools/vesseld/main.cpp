@@ -105,7 +105,7 @@ int main(int argc, char** argv) {
     reloadDeviceFacts();
     // Asked-for verbosity wins, whichever asked: --debug, VESSELD_DEBUG or device.plist.
     if (auto level = deviceFacts().logLevel; level && *level > logVerbosity()) setLogVerbosity(*level);
-    // Before any thread starts: the passed sockets are looked up by descriptor number.
+    // Before any thread starts: taking the passed sockets clears their environment variables.
     adoptActivatedSockets();
     startSignalThread();
 
