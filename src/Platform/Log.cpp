@@ -15,9 +15,8 @@
 #include <ctime>
 #include <mutex>
 
-#include <systemd/sd-journal.h>
-
 #include "Platform/DurableIO.h"
+#include "Platform/JournalSink.h"
 #include "Platform/UniqueFd.h"
 
 namespace vsl {
@@ -101,7 +100,7 @@ OSLogMode decideOSLogMode() {
     if (forced && std::strcmp(forced, "stderr") == 0) return OSLogMode::Stderr;
     if (forced && std::strcmp(forced, "off") == 0) return OSLogMode::Off;
     if (forced && std::strcmp(forced, "journal") == 0) return OSLogMode::Journal;
-    return ::access("/run/systemd/journal/socket", F_OK) == 0 ? OSLogMode::Journal : OSLogMode::Stderr;
+    return ::access(journalSocketPath().c_str(), F_OK) == 0 ? OSLogMode::Journal : OSLogMode::Stderr;
 }
 
 OSLogMode osLogMode() {
@@ -156,18 +155,30 @@ void writeRecordToStderr(const OSLogRecord& r) {
 }
 
 void sendRecordToJournal(const OSLogRecord& r) {
-    std::string text = recordText(r);
-    int rc;
+    const std::string text = recordText(r);
+    const std::string priority = std::to_string(journalPriority(r.level));
+    std::vector<JournalField> fields = {{"MESSAGE", text},
+                                        {"PRIORITY", priority},
+                                        {"SUBSYSTEM", logSubsystemName(r.category)},
+                                        {"CATEGORY", logCategoryName(r.category)}};
+    const std::string id = std::to_string(r.signpostId);
     if (r.signpostEvent) {
-        rc = sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", journalPriority(r.level), "SUBSYSTEM=%s",
-                             logSubsystemName(r.category), "CATEGORY=%s", logCategoryName(r.category),
-                             "SIGNPOST_ID=%" PRIu64, r.signpostId, "SIGNPOST_NAME=%s",
-                             r.signpostName ? r.signpostName : "", "SIGNPOST_EVENT=%s", r.signpostEvent, nullptr);
-    } else {
-        rc = sd_journal_send("MESSAGE=%s", text.c_str(), "PRIORITY=%d", journalPriority(r.level), "SUBSYSTEM=%s",
-                             logSubsystemName(r.category), "CATEGORY=%s", logCategoryName(r.category), nullptr);
+        fields.push_back({"SIGNPOST_ID", id});
+        fields.push_back({"SIGNPOST_NAME", r.signpostName ? r.signpostName : ""});
+        fields.push_back({"SIGNPOST_EVENT", r.signpostEvent});
     }
-    if (rc < 0) writeRecordToStderr(r);  // the journal went away: keep the line
+    if (!journalSend(fields)) writeRecordToStderr(r);  // the journal went away: keep the line
+}
+
+// The rotating log's entry in the journal as well, when the service manager started us.
+bool sendLogWriteToJournal(int level, const char* function, const std::string& message) {
+    if (!journalTakesLogWrite()) return false;
+    const std::string priority = std::to_string(level);
+    return journalSend({{"MESSAGE", message},
+                        {"PRIORITY", priority},
+                        {"SUBSYSTEM", logSubsystemName(LogCategory::Unspecified)},
+                        {"CATEGORY", logCategoryName(LogCategory::Unspecified)},
+                        {"CODE_FUNC", function ? function : "(null)"}});
 }
 
 LogVerbosity verbosityForOSLogLevel(OSLogLevel level) {
@@ -271,11 +282,13 @@ void logWriteLine(int level, const char* function, const std::string& message) {
     line += ": ";
     line += message;
     line += '\n';
+    // Under the service manager stderr is the journal too: an entry sent needs no copy there.
+    const bool journaled = sendLogWriteToJournal(level, function, message);
 
     FileLog& log = fileLog();
     std::lock_guard lock(log.mutex);
     if (log.fd < 0) {
-        writeAll(STDERR_FILENO, line);
+        if (!journaled) writeAll(STDERR_FILENO, line);
         return;
     }
     if (log.size > 0 && log.size + line.size() > log.options.maxBytes) rotateLocked(log);
@@ -283,7 +296,7 @@ void logWriteLine(int level, const char* function, const std::string& message) {
         writeAll(log.fd, line);
         log.size += line.size();
     }
-    if (log.fd < 0 || gMirrorToStderr.load(std::memory_order_relaxed)) writeAll(STDERR_FILENO, line);
+    if ((log.fd < 0 && !journaled) || gMirrorToStderr.load(std::memory_order_relaxed)) writeAll(STDERR_FILENO, line);
 }
 
 // ---- structured log ----

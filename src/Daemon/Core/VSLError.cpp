@@ -1,5 +1,7 @@
 #include "Daemon/Core/VSLError.h"
 
+#include "Platform/LogFields.h"
+
 namespace vsl {
 
 const char* const VSLErrorDomain = "VSLErrorDomain";
@@ -16,6 +18,8 @@ VSLErrorRef makeVSLError(const char* function, int line, uint64_t code, VSLError
     e->functionName = function ? function : "";
     e->sourceFileLine = line;
     if (log && e->localizedDescription) {
+        const std::string codeText = std::to_string(code);
+        LogFieldScope codeField(kLogFieldErrorCode, codeText);
         if (e->underlyingError)
             LogWrite(kLogLevelError, e->functionName.c_str(), "%d: %@ (%@)", line, *e->localizedDescription,
                      e->underlyingError);

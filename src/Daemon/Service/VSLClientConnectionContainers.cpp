@@ -21,6 +21,7 @@
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/DurableIO.h"
+#include "Platform/LogFields.h"
 #include "Platform/SandboxExtension.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
@@ -143,6 +144,7 @@ VSLMetadataRef VSLClientConnection::createOrLookupContainerWithContainerIdentity
     const VSLContainerIdentityRef& identity, bool createIfNecessary, bool transient, bool useLocking, uint64_t* code) {
     VSLMetadataRef result;
     VSLErrorRef error;
+    LogFieldScope identifierField(kLogFieldContainerIdentifier, identity ? identity->identifier() : std::string_view());
     bool ok = guardExceptions(kCreateFn, __LINE__, &error, [&]() -> bool {
         osLog(LogCategory::Unspecified, OSLogLevel::Debug,
               "createOrLookup; identity: %@, createIfNecessary: %d, transient: %d, allowOtherIdLookup: %d, "
@@ -250,9 +252,13 @@ VSLMetadataRef VSLClientConnection::createContainer(const VSLContainerIdentityRe
     auto concrete = VSLConcreteContainerIdentity::containerIdentityWithUUID(Uuid::random(), user,
                                                                             identity->identifier(), c, &idCode);
     if (!concrete) return cleanUp(createVSLError(kCreateFn, __LINE__, idCode, nullptr, false));
+    const std::string uuidText = concrete->uuid().string();
+    LogFieldScope uuidField(kLogFieldContainerUUID, uuidText);
     auto metadata = VSLMetadata::initWithContainerIdentity(concrete, std::nullopt, staging, std::nullopt);
+    // Fails as a metadata write that cannot reach the disk does, logged where it is made.
     if (creationFailureInjectedFor(identity->identifier()))
-        return cleanUp(VSL_POSIX_ERROR(EIO, "Injected failure creating %@", identity->identifier()));
+        return cleanUp(VSL_ERROR(kVSLErrorWriteFile, VSL_POSIX_ERROR(EIO, "Injected failure"), true,
+                                 "Failed to write metadata for %@", identity->identifier()));
     if (!metadata->writeMetadataToDiskWithError(&underlying)) return cleanUp(underlying);
     if (isSystemContainerClass(c) && !fm.setTopLevelSystemContainerACLAtURL(staging, &underlying))
         return cleanUp(underlying);

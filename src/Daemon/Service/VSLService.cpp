@@ -1,6 +1,7 @@
 #include "Daemon/Service/VSLService.h"
 
 #include "Daemon/Service/VSLProcessIPCEvent.h"
+#include "Platform/ServiceManager.h"
 
 #ifdef VESSEL_KILLPOINTS
 #include <cstdlib>
@@ -41,6 +42,7 @@ void delayForTests(const Value& body) {
 std::unique_ptr<VSLService> VSLService::start(const std::shared_ptr<WorkQueue>& listenerQueue, std::string* error) {
     IpcServerOptions options;
     options.path = defaultIpcServicePath();
+    options.listenFd = takeActivatedSocket("vesseld").release();
     options.connectionQueue = listenerQueue;
     options.maxConnectionsPerUid = kVSLConnectionsPerUser;
     options.maxConnectionsPrivileged = kVSLConnectionsPrivileged;

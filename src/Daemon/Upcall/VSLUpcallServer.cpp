@@ -6,6 +6,7 @@
 #include "Daemon/Upcall/VSLUpcallDemux.h"
 #include "Platform/IpcServer.h"
 #include "Platform/Log.h"
+#include "Platform/ServiceManager.h"
 #include "Platform/UpcallWire.h"
 #include "Platform/WorkQueue.h"
 
@@ -71,6 +72,7 @@ bool startKernelUpcallServer(std::string* error) {
     auto state = std::make_shared<UpcallServer>();
     IpcServerOptions options;
     options.path = defaultUpcallServicePath();
+    options.listenFd = takeActivatedSocket("upcall").release();
     options.framing = upcallServerFraming();
     options.socketMode = 0600;
     options.maxConnectionsPerUid = kUpcallConnections;

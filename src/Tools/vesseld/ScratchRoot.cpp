@@ -69,6 +69,9 @@ std::string vesselctlPath() {
     if (::realpath(candidate.c_str(), real)) return real;
     candidate = joinPath(parentPath(self), "vesselctl");
     if (::realpath(candidate.c_str(), real)) return real;
+    // Installed: /usr/sbin/vesseld beside /usr/bin/vesselctl.
+    candidate = joinPath(parentPath(self), "../bin/vesselctl");
+    if (::realpath(candidate.c_str(), real)) return real;
     return {};
 }
 

@@ -21,6 +21,7 @@
 #include "Daemon/Upcall/VSLUpcallServer.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
+#include "Platform/ServiceManager.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/Transaction.h"
 #include "Platform/WorkQueue.h"
@@ -53,6 +54,7 @@ void startSignalThread() {
     std::thread([set] {
         int sig = 0;
         sigwait(&set, &sig);
+        notifyServiceStopping();
         stopMainLoop();
         const auto limit = std::chrono::duration_cast<std::chrono::seconds>(kStopLimit).count();
         const timespec wait{static_cast<time_t>(limit), 0};
@@ -103,11 +105,15 @@ int main(int argc, char** argv) {
     reloadDeviceFacts();
     // Asked-for verbosity wins, whichever asked: --debug, VESSELD_DEBUG or device.plist.
     if (auto level = deviceFacts().logLevel; level && *level > logVerbosity()) setLogVerbosity(*level);
+    // Before any thread starts: taking the passed sockets clears their environment variables.
+    adoptActivatedSockets();
     startSignalThread();
 
     auto listenerQueue = WorkQueue::serial("com.tarrow.vesseld.listener");
     auto startup = std::make_shared<Transaction>("com.tarrow.vesseld.startup");
     listenerQueue->async([startup] { vesseld_init(startup); });
+    // Queued behind start-up, as every new connection is: none is served before it.
+    listenerQueue->async([] { notifyServiceReady(); });
 
     std::string error;
     auto service = VSLService::start(listenerQueue, &error);
