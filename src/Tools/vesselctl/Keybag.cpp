@@ -1,4 +1,5 @@
-#include "Keybag.h"
+// vesselctl keybag lock|unlock|state: the device lock state of a system root, without
+// the daemon (it learns of a change through the lock-status notification).
 
 #include <cstdio>
 #include <cstring>
