@@ -18,13 +18,15 @@ TEST(VesselctlManPage, ListsTheSubcommandsOfHelpInOrderEachWithItsJsonKeys) {
     EXPECT_EQ(help, documented) << "docs/man/vesselctl.1.md and vesselctl --help disagree";
 }
 
-TEST(VesselctlManPage, UnknownSubcommandOrOptionPrintsUsageAndExitsTwo) {
+TEST(VesselctlManPage, UnknownSubcommandOptionOrKeyPrintsUsageAndExitsTwo) {
     struct Case {
         std::vector<std::string> args;
         const char* what;
     } cases[] = {
         {{"frobnicate"}, "unknown subcommand"},
         {{"create", "com.example.app", "--colour", "red"}, "unknown option of a verb"},
+        {{"create", "com.example.app", "Colour=red"}, "unknown key"},
+        {{"createOrLookup", "Identifer=com.example.app"}, "unknown key of a raw command"},
         {{"create", "com.example.app", "--class", "teapot"}, "unknown class"},
         {{"info", "peek", "com.example.app", "k"}, "unknown info verb"},
         {{"--frobnicate", "status"}, "unknown global option"},

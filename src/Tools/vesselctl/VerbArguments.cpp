@@ -31,6 +31,15 @@ std::optional<uint64_t> containerClassNamed(const std::string& name) {
     return std::nullopt;
 }
 
+std::optional<std::pair<std::string, Value>> parseKeyValue(const std::string& word, std::string* error) {
+    const std::string key = word.substr(0, word.find('='));
+    if (key.find(':') == std::string::npos && !client::isRequestKey(key)) {
+        *error = "unknown key \"" + key + "\" (key:type=value sends it anyway)";
+        return std::nullopt;
+    }
+    return client::parseArgument(word, error);
+}
+
 bool parseVerbArguments(const std::vector<std::string>& words, VerbArguments* out, std::string* error,
                         bool classOption) {
     for (size_t i = 0; i < words.size(); i++) {
@@ -50,7 +59,7 @@ bool parseVerbArguments(const std::vector<std::string>& words, VerbArguments* ou
             *error = "unknown option " + w;
             return false;
         } else if (w.find('=') != std::string::npos && w[0] != '-') {
-            auto kv = client::parseArgument(w, error);
+            auto kv = parseKeyValue(w, error);
             if (!kv) return false;
             out->keys.insert_or_assign(kv->first, kv->second);
         } else {

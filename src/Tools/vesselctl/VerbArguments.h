@@ -5,6 +5,7 @@
 #include <cstdint>
 #include <optional>
 #include <string>
+#include <utility>
 #include <vector>
 
 #include "Platform/Value.h"
@@ -15,7 +16,11 @@ struct VerbArguments {
     vsl::Dictionary keys;                    // key=value, added to the request last
 };
 
-// False with a reason for a malformed key=value, an unknown class or, with
+// One key=value argument; an untyped key the protocol does not have is refused
+// (key:type=value sends any key).
+std::optional<std::pair<std::string, vsl::Value>> parseKeyValue(const std::string& word, std::string* error);
+
+// False with a reason for a malformed key=value or unknown key, an unknown class or, with
 // `classOption`, an unknown --option (without it such words stay positional).
 bool parseVerbArguments(const std::vector<std::string>& words, VerbArguments* out, std::string* error,
                         bool classOption = true);

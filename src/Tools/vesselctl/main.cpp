@@ -5,7 +5,6 @@
 #include <cstdlib>
 #include <string>
 
-#include "Client/VSLArguments.h"
 #include "Client/VSLProtocol.h"
 #include "SubcommandTable.h"
 #include "VerbArguments.h"
@@ -52,7 +51,7 @@ int runRawCommand(const CtlOptions& options, const SubcommandArgs& args) {
     Dictionary request{{"Command", Value::uint64(*number)}};
     for (const auto& word : args.words) {
         std::string error;
-        auto kv = client::parseArgument(word, &error);
+        auto kv = parseKeyValue(word, &error);
         if (!kv) return printUsageError(options, args.name + " [key=value ...]\n  " + error);
         request.insert_or_assign(kv->first, kv->second);
     }
