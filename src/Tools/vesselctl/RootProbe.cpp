@@ -5,6 +5,7 @@
 #include <semaphore.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
+#include <sys/sysmacros.h>
 #include <sys/un.h>
 
 #include <cerrno>
@@ -38,7 +39,35 @@ int connectTo(const std::string& socketPath, UniqueFd* fd) {
 
 }  // namespace
 
+namespace {
+
+// The holder of the lock the serving daemon keeps on "<socket>.lock", from /proc/locks:
+// right also when the listening socket was made by another process and handed over.
+std::optional<pid_t> lockHolder(const std::string& lockPath) {
+    struct stat st;
+    if (::stat(lockPath.c_str(), &st) != 0) return std::nullopt;
+    char device[64];
+    std::snprintf(device, sizeof device, "%02x:%02x:%llu", major(st.st_dev), minor(st.st_dev),
+                  (unsigned long long)st.st_ino);
+    FILE* locks = std::fopen("/proc/locks", "re");
+    if (!locks) return std::nullopt;
+    std::optional<pid_t> holder;
+    char line[512];
+    while (!holder && std::fgets(line, sizeof line, locks)) {
+        char type[32], kind[32], mode[32], where[64];
+        long pid = 0;
+        if (std::sscanf(line, "%*s %31s %31s %31s %ld %63s", type, kind, mode, &pid, where) == 5 &&
+            std::strcmp(type, "FLOCK") == 0 && std::strcmp(where, device) == 0 && pid > 0)
+            holder = static_cast<pid_t>(pid);
+    }
+    std::fclose(locks);
+    return holder;
+}
+
+}  // namespace
+
 std::optional<pid_t> daemonPid(const std::string& socketPath) {
+    if (auto holder = lockHolder(socketPath + ".lock")) return holder;
     UniqueFd fd;
     if (connectTo(socketPath, &fd) != 0) return std::nullopt;
     ucred credentials{};

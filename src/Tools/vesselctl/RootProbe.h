@@ -10,7 +10,8 @@
 #include "Output.h"
 #include "Platform/Value.h"
 
-// The daemon's pid from the listening socket's peer credentials; none when nothing answers.
+// The daemon's pid: the holder of its socket's lock file, else the peer credentials of
+// the listening socket; none when nothing answers.
 std::optional<pid_t> daemonPid(const std::string& socketPath);
 
 // Whether the socket file exists while nothing listens on it.

@@ -4,7 +4,6 @@
 // ContainersPerClass PendingProtectionChanges ReplaceJournals DeathRowItems.
 #include <chrono>
 #include <cstdio>
-#include <sys/stat.h>
 
 #include "Client/VSLArguments.h"
 #include "Client/VSLConnection.h"

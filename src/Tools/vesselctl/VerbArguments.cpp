@@ -2,6 +2,7 @@
 
 #include <strings.h>
 
+#include <cerrno>
 #include <cstdlib>
 
 #include "Client/VSLArguments.h"
@@ -10,9 +11,11 @@
 using namespace vsl;
 
 std::optional<uint64_t> parseNumber(const std::string& text) {
-    if (text.empty() || text.find_first_not_of("0123456789") != std::string::npos || text.size() > 19)
-        return std::nullopt;
-    return std::strtoull(text.c_str(), nullptr, 10);
+    if (text.empty() || text.find_first_not_of("0123456789") != std::string::npos) return std::nullopt;
+    errno = 0;
+    unsigned long long n = std::strtoull(text.c_str(), nullptr, 10);
+    if (errno == ERANGE) return std::nullopt;
+    return n;
 }
 
 std::optional<uint64_t> containerClassNamed(const std::string& name) {

@@ -34,6 +34,11 @@ int usage(FILE* out) {
         std::string line = std::string(s.name) + (*s.synopsis ? " " : "") + s.synopsis;
         std::fprintf(out, "  %-44s %s\n", line.c_str(), s.summary);
     }
+    std::fprintf(out,
+                 "\nreplace without words sends the keys as given:\n"
+                 "  OldIdentifier=ID OldContainerClass=N OldContainerUUID=UUID [OldPersonaUniqueString=S]\n"
+                 "  NewIdentifier=ID NewContainerClass=N NewContainerUUID=UUID [NewPersonaUniqueString=S]\n"
+                 "  Without the Old keys the new container is made permanent in its class.\n");
     std::fprintf(out, "\ncommands (the protocol's, by name or number):\n");
     for (uint64_t i = 0; i < kVSLProtocolCommandCount; i++)
         std::fprintf(out, "  %2llu  %s\n", (unsigned long long)i, commandName(i));
