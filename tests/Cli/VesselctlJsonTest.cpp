@@ -160,5 +160,14 @@ TEST(VesselctlJson, EverySubcommandPrintsItsDocumentedKeys) {
         }
     }
     for (const auto& [name, keys] : documented) EXPECT_TRUE(covered.count(name)) << name << " was not run";
+
+    // Strings that JSON must escape come back as they went in.
+    const std::string awkward = "com.example.\"quoted\"\\back\tslash\u00fc";
+    std::string out, err;
+    EXPECT_EQ(0, runProgram({ctl, "--root", daemon.root(), "--json", "create", awkward}, &out, &err)) << err;
+    auto json = parseJson(out);
+    ASSERT_TRUE(json) << out;
+    ASSERT_TRUE(json->find("ReplyIdentifier")) << out;
+    EXPECT_EQ(awkward, *json->find("ReplyIdentifier")->stringValue());
     EXPECT_EQ(0, daemon.stop());
 }
