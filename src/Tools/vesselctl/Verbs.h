@@ -9,8 +9,9 @@
 #include "VerbArguments.h"
 
 // Parses the words, lets `build` fill the request (false: a usage error), adds the
-// key=value arguments and sends it. Commands that name a container by its UUID as
-// well (`needsUUID`) get it from a lookup first unless UUID= was given.
+// key=value arguments and sends it; a usage error prints the entry's synopsis.
+// Commands that name a container by its UUID as well (`needsUUID`) get it from a
+// lookup first unless UUID= was given.
 int runVerb(const CtlOptions& options, const SubcommandArgs& args,
             const std::function<bool(const VerbArguments&, vsl::Dictionary&)>& build, bool needsUUID = false);
 
