@@ -28,6 +28,17 @@ const std::map<std::string, std::string>& knownKeyTypes() {
     return types;
 }
 
+// Request keys of any value type, typed only by what they are given.
+bool isUntypedRequestKey(const std::string& key) {
+    static const char* const keys[] = {"Identifier",       "PersonaUniqueString", "Key",
+                                       "Value",            "GroupIdentifier",     "SourcePath",
+                                       "DestPath",         "OldIdentifier",       "NewIdentifier",
+                                       "OldPersonaUniqueString", "NewPersonaUniqueString"};
+    for (const char* k : keys)
+        if (key == k) return true;
+    return false;
+}
+
 std::optional<uint64_t> parseU64(const std::string& s) {
     if (s.empty() || s[0] == '-') return std::nullopt;
     errno = 0;
@@ -110,6 +121,8 @@ std::optional<Value> parseTyped(const std::string& type, const std::string& text
 }
 
 }  // namespace
+
+bool isRequestKey(const std::string& key) { return knownKeyTypes().count(key) || isUntypedRequestKey(key); }
 
 std::optional<std::pair<std::string, Value>> parseArgument(const std::string& text, std::string* error) {
     size_t eq = text.find('=');

@@ -14,6 +14,9 @@ namespace vsl::client {
 
 std::optional<std::pair<std::string, Value>> parseArgument(const std::string& text, std::string* error);
 
+// Whether the protocol has a request key of this name.
+bool isRequestKey(const std::string& key);
+
 // Renders a reply for people ("Key: value" lines) or as JSON.
 std::string renderHuman(const Value& reply);
 std::string renderJson(const Value& value);

@@ -171,7 +171,7 @@ TEST_F(ReplaceContainer, RefusedReplacementsChangeNothing) {
                              "NewContainerUUID=" + other.uuid.string()},
                             &json, &jsonErr);
     EXPECT_EQ(1, status) << "another class";
-    EXPECT_NE(std::string::npos, json.find("\"ReplyError\":23")) << json << jsonErr;
+    EXPECT_NE(std::string::npos, json.find("\"error\":23")) << json << jsonErr;
     // Promotion of the transient container while the permanent one exists.
     r = daemon.run(admin, {"replace", std::string("NewIdentifier=") + kApp, "NewContainerClass=2",
                            "NewContainerUUID=" + fresh.uuid.string()});

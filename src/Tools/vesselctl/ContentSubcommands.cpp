@@ -1,54 +1,34 @@
-#include "ContentSubcommands.h"
-
-#include <cstdlib>
-#include <vector>
-
-#include "Client/VSLProtocol.h"
+// The subcommands for the content of containers:
+//   wipe-content ID CLASS          deleteContainerContent
+//   stage-shared GROUP SRC DEST    stageSharedContent (paths relative to the container)
+//   assets-path [ID] [--relative] [--create]   userManagedAssetsPath
+//   assets-delete ID PATH          deleteUserManagedAsset (PATH relative to the assets directory)
+#include "Subcommands.h"
+#include "VerbArguments.h"
 
 using namespace vsl;
 
-const char* const kContentSubcommandUsage =
-    "  wipe ID | wipe-content ID CLASS | stage-shared GROUP SRC DEST\n"
-    "  assets-path [ID] [--relative] [--create] | assets-delete ID PATH\n";
-
-namespace {
-
-Dictionary command(const char* name) {
-    return {{"Command", Value::uint64(*commandNumberForName(name))}};
-}
-
-}  // namespace
-
-std::optional<Dictionary> contentSubcommandRequest(int argc, char** argv, int* index, std::string* error) {
-    const int i = *index;
-    const std::string word = argv[i];
-    // The words after the subcommand, up to the first key=value argument.
-    std::vector<std::string> words;
-    for (int j = i + 1; j < argc && std::string(argv[j]).find('=') == std::string::npos; j++) words.push_back(argv[j]);
+std::optional<Dictionary> contentRequest(const std::string& name, const std::vector<std::string>& words,
+                                         std::string* error) {
     auto usage = [&](const char* text) {
-        *error = std::string("usage: vesselctl ") + text;
+        *error = text;
         return Dictionary{};
     };
     Dictionary request;
-    if (word == "wipe") {
-        if (words.size() != 1) return usage("wipe ID");
-        request = command("wipeContainer");
+    if (name == "wipe-content") {
+        auto c = words.size() == 2 ? parseNumber(words[1]) : std::nullopt;
+        if (!c) return usage("wipe-content ID CLASS");
+        request = commandRequest("deleteContainerContent");
         request["Identifier"] = Value::string(words[0]);
-    } else if (word == "wipe-content") {
-        char* end = nullptr;
-        unsigned long long c = words.size() == 2 ? std::strtoull(words[1].c_str(), &end, 10) : 0;
-        if (words.size() != 2 || words[1].empty() || *end) return usage("wipe-content ID CLASS");
-        request = command("deleteContainerContent");
-        request["Identifier"] = Value::string(words[0]);
-        request["ContainerClass"] = Value::uint64(c);
-    } else if (word == "stage-shared") {
+        request["ContainerClass"] = Value::uint64(*c);
+    } else if (name == "stage-shared") {
         if (words.size() != 3) return usage("stage-shared GROUP SRC DEST");
-        request = command("stageSharedContent");
+        request = commandRequest("stageSharedContent");
         request["Identifier"] = Value::string(words[0]);
         request["SourcePath"] = Value::string(words[1]);
         request["DestPath"] = Value::string(words[2]);
-    } else if (word == "assets-path") {
-        request = command("userManagedAssetsPath");
+    } else if (name == "assets-path") {
+        request = commandRequest("userManagedAssetsPath");
         request["IsRelative"] = Value::boolean(false);
         request["CreateIfNecessary"] = Value::boolean(false);
         for (const auto& w : words) {
@@ -61,14 +41,13 @@ std::optional<Dictionary> contentSubcommandRequest(int argc, char** argv, int* i
             else
                 return usage("assets-path [ID] [--relative] [--create]");
         }
-    } else if (word == "assets-delete") {
+    } else if (name == "assets-delete") {
         if (words.size() != 2) return usage("assets-delete ID PATH");
-        request = command("deleteUserManagedAsset");
+        request = commandRequest("deleteUserManagedAsset");
         request["Identifier"] = Value::string(words[0]);
         request["SourcePath"] = Value::string(words[1]);
     } else {
         return std::nullopt;
     }
-    *index = i + 1 + static_cast<int>(words.size());
     return request;
 }

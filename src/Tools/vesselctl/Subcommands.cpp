@@ -1,109 +1,65 @@
 #include "Subcommands.h"
 
-#include "ContentSubcommands.h"
-
-#include "Client/VSLProtocol.h"
-
 #include <cstdlib>
-#include <cstring>
 
+#include "Client/VSLArguments.h"
+#include "Client/VSLProtocol.h"
+#include "SubcommandTable.h"
+#include "VerbArguments.h"
 
 using namespace vsl;
 
-const char* const kSubcommandUsage =
-    "  info get KEY | info set KEY [Value[:type]=V]   (with Identifier= ContainerClass= UUID=)\n"
-    "  metadata | recreate-structure | regenerate-uuid | du   (with the same keys)\n"
-    "  test-lock N on|off | retry-test N\n"
-    "  migrate | migrate-user   (data migration; per-user migration)\n"
-    "  protect CLASS   (with Identifier= [ContainerClass=2] [RetryIfLocked=true] [IsThirdParty=true])\n"
-    "  keybag lock|unlock|state   (the device lock state of the root; no daemon needed)\n";
-
-namespace {
-
-std::optional<uint64_t> number(const char* text) {
-    char* end = nullptr;
-    unsigned long long n = std::strtoull(text, &end, 10);
-    if (!*text || *end) return std::nullopt;
-    return n;
+Dictionary commandRequest(const char* commandName) {
+    return {{"Command", Value::uint64(*commandNumberForName(commandName))}};
 }
 
-Dictionary command(uint64_t number) { return {{"Command", Value::uint64(number)}}; }
-
-}  // namespace
-
-std::optional<Dictionary> subcommandRequest(int argc, char** argv, int* index, std::string* error) {
-    if (auto group = groupSubcommandRequest(argc, argv, index, error)) return group;
-    const int i = *index;
-    const std::string word = argv[i];
-    auto need = [&](int words, const char* usage) {
-        if (i + words < argc) return true;
-        *error = std::string("usage: vesselctl ") + usage;
-        return false;
+std::optional<Dictionary> namedRequest(const std::string& name, const std::vector<std::string>& words,
+                                       std::string* error) {
+    auto usage = [&](const char* text) {
+        *error = text;
+        return Dictionary{};
     };
     Dictionary request;
-    if (word == "info") {
-        if (!need(2, "info get|set KEY ...")) return Dictionary{};
-        std::string verb = argv[i + 1];
-        if (verb != "get" && verb != "set") {
-            *error = "usage: vesselctl info get|set KEY ...";
-            return Dictionary{};
-        }
-        request = command(verb == "get" ? 6 : 5);
-        request["Key"] = Value::string(argv[i + 2]);
-        *index = i + 3;
-        return request;
-    }
-    if (word == "metadata") {
-        request = command(7);
+    if (name == "metadata") {
+        request = commandRequest("metadata");
         request["InfoDictRequested"] = Value::boolean(true);
-    } else if (word == "recreate-structure") {
-        request = command(8);
-    } else if (word == "regenerate-uuid") {
-        request = command(9);
-    } else if (word == "du") {
-        request = command(23);
-    } else if (word == "migrate") {
-        request = command(*commandNumberForName("performDataMigration"));
-    } else if (word == "migrate-user") {
-        request = command(*commandNumberForName("performPerUserDataMigration"));
-    } else if (word == "test-lock") {
-        if (!need(2, "test-lock N on|off")) return Dictionary{};
-        auto lock = number(argv[i + 1]);
-        std::string state = argv[i + 2];
-        if (!lock || (state != "on" && state != "off")) {
-            *error = "usage: vesselctl test-lock N on|off";
-            return Dictionary{};
-        }
-        request = command(31);
+    } else if (name == "recreate-structure") {
+        request = commandRequest("recreateDefaultStructure");
+    } else if (name == "regenerate-uuid") {
+        request = commandRequest("regenerateDirectoryUUID");
+    } else if (name == "migrate") {
+        request = commandRequest("performDataMigration");
+    } else if (name == "migrate-user") {
+        request = commandRequest("performPerUserDataMigration");
+    } else if (name == "test-lock") {
+        auto lock = words.size() == 2 ? parseNumber(words[0]) : std::nullopt;
+        if (!lock || (words[1] != "on" && words[1] != "off")) return usage("test-lock N on|off");
+        request = commandRequest("setTestLock");
         request["TestLock"] = Value::uint64(*lock);
-        request["Enable"] = Value::boolean(state == "on");
-        *index = i + 3;
+        request["Enable"] = Value::boolean(words[1] == "on");
         return request;
-    } else if (word == "protect") {
-        char* end = nullptr;
-        long long cls = i + 1 < argc ? std::strtoll(argv[i + 1], &end, 10) : 0;
-        if (i + 1 >= argc || !*argv[i + 1] || *end) {
-            *error = "usage: vesselctl protect CLASS Identifier=ID [ContainerClass=N] [RetryIfLocked=true]";
-            return Dictionary{};
-        }
-        request = command(21);
-        request["ContainerClass"] = Value::uint64(2);
-        request["DataProtectionClass"] = Value::int64(cls);
-        *index = i + 2;
-        return request;
-    } else if (word == "retry-test") {
-        auto crashes = i + 1 < argc ? number(argv[i + 1]) : std::nullopt;
-        if (!crashes) {
-            *error = "usage: vesselctl retry-test N";
-            return Dictionary{};
-        }
-        request = command(25);
+    } else if (name == "retry-test") {
+        auto crashes = words.size() == 1 ? parseNumber(words[0]) : std::nullopt;
+        if (!crashes) return usage("retry-test N");
+        request = commandRequest("retryTest");
         request["NumRetryCrashes"] = Value::uint64(*crashes);
-        *index = i + 2;
         return request;
+    } else if (auto group = groupRequest(name, words, error)) {
+        return group;
     } else {
-        return contentSubcommandRequest(argc, argv, index, error);
+        return contentRequest(name, words, error);
     }
-    *index = i + 1;
+    if (!words.empty()) *error = name + " [KEY=VALUE...]";
     return request;
+}
+
+int runRequestSubcommand(const CtlOptions& options, const SubcommandArgs& args) {
+    VerbArguments parsed;
+    std::string error;
+    if (!parseVerbArguments(args.words, &parsed, &error, /*classOption=*/false))
+        return printUsageError(options, args.name + ": " + error);
+    auto request = namedRequest(args.name, parsed.positional, &error);
+    if (!error.empty() || !request) return printUsageError(options, error.empty() ? args.name : error);
+    for (auto& [key, value] : parsed.keys) request->insert_or_assign(key, value);
+    return sendAndPrint(options, *request);
 }

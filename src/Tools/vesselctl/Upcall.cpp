@@ -1,4 +1,8 @@
-#include "Upcall.h"
+// `vesselctl upcall`: asks the kernel upcall channel for a process's containers, as
+// the kernel would, and prints the reply items.
+//   upcall uid=N [container-id=ID] [signature-id=ID] [application-id=ID] [type=0|1]
+//          [group=ID]... [system-container=ID] [system-group=ID]... [persona=N]
+// Exit status: 0 for return code 0 with status 1, 1 for any other answer.
 
 #include <cerrno>
 #include <cstdio>
@@ -7,14 +11,10 @@
 
 #include "Client/VSLArguments.h"
 #include "Client/VSLUpcallClient.h"
+#include "SubcommandTable.h"
 
 using namespace vsl;
 using namespace vsl::client;
-
-const char* const kUpcallUsage =
-    "  upcall uid=N [container-id=ID] [signature-id=ID] [application-id=ID] [type=0|1]\n"
-    "         [group=ID]... [system-container=ID] [system-group=ID]... [persona=N]\n"
-    "                                 asks the kernel upcall channel for a process's containers\n";
 
 namespace {
 
@@ -59,52 +59,38 @@ bool addWord(const std::string& word, VSLUpcallQuery* query, std::string* error)
 
 }  // namespace
 
-int runUpcallSubcommand(const std::string& socketPath, bool asJson, long timeoutSeconds, int argc, char** argv,
-                        int index) {
+int runUpcall(const CtlOptions& options, const SubcommandArgs& args) {
+    const std::string socketPath =
+        options.socketPath.empty() ? VSLUpcallClient::socketPathForSystemRoot(options.root) : options.socketPath;
     VSLUpcallQuery query;
     std::string error;
-    for (int i = index; i < argc; i++) {
-        if (!addWord(argv[i], &query, &error)) {
-            std::fprintf(stderr, "vesselctl: %s\n", error.c_str());
-            return 2;
-        }
+    for (const auto& word : args.words) {
+        if (!addWord(word.c_str(), &query, &error)) return printUsageError(options, "upcall uid=N ...\n  " + error);
     }
-    if (!query.uid) {
-        std::fprintf(stderr, "vesselctl: upcall needs uid=N\n");
-        return 2;
-    }
+    if (!query.uid) return printUsageError(options, "upcall uid=N ...\n  upcall needs uid=N");
     if (!query.personaID) query.personaID = 0xFFFFFFFF;
     auto packbuff = packUpcallQuery(query);
-    if (!packbuff) {
-        std::fprintf(stderr, "vesselctl: the request cannot be packed\n");
-        return 2;
-    }
+    if (!packbuff) return printUsageError(options, "upcall uid=N ...\n  the request cannot be packed");
     auto client = VSLUpcallClient::connect(socketPath, &error);
-    if (!client) {
-        std::fprintf(stderr, "vesselctl: cannot reach the kernel upcall channel: %s\n", error.c_str());
-        return 3;
-    }
+    if (!client)
+        return printFailure(options, kExitUnreachable, 0, "Unreachable",
+                            "cannot reach the kernel upcall channel: " + error);
     UpcallReplyFrame frame;
-    const auto status =
-        client->getProcessContainers(*packbuff, &frame, std::chrono::milliseconds(timeoutSeconds * 1000), &error);
-    if (status != VSLUpcallStatus::Ok) {
-        std::fprintf(stderr, "vesselctl: upcall failed (%s): %s\n", upcallStatusName(status), error.c_str());
-        return 3;
-    }
+    const auto status = client->getProcessContainers(
+        *packbuff, &frame, std::chrono::milliseconds(options.timeoutSeconds * 1000), &error);
+    if (status != VSLUpcallStatus::Ok)
+        return printFailure(options, kExitUnreachable, 0, upcallStatusName(status), "upcall failed: " + error);
     Dictionary out{{"ReturnCode", Value::int64(frame.returnCode)}};
     bool complete = false;
     if (frame.returnCode == 0) {
         auto containers = unpackUpcallReply(frame.packbuff, &error);
-        if (!containers) {
-            std::fprintf(stderr, "vesselctl: unreadable reply: %s\n", error.c_str());
-            return 3;
-        }
+        if (!containers) return printFailure(options, kExitUnreachable, 0, "BadReply", "unreadable reply: " + error);
         complete = containers->status == 1u;
         const Value items = containers->value();
         for (const auto& [key, value] : *items.dictionaryValue()) out.insert_or_assign(key, value);
     }
     const Value reply = Value::dictionary(std::move(out));
-    if (asJson) {
+    if (options.json) {
         std::printf("%s\n", renderJson(reply).c_str());
     } else {
         std::printf("%s", renderHuman(reply).c_str());
