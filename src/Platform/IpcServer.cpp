@@ -58,9 +58,22 @@ std::unique_ptr<IpcServer> IpcServer::start(IpcServerOptions options, std::strin
         options.listenFd = -1;
         ::fcntl(fd, F_SETFL, ::fcntl(fd, F_GETFL) | O_NONBLOCK);
         ::fcntl(fd, F_SETFD, FD_CLOEXEC);
+        // The service manager owns the socket file; the lock still names the serving
+        // process to whoever asks (vesselctl status reads its holder).
+        int lockFd = -1;
+        if (!options.path.empty()) {
+            lockFd = ::open((options.path + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+            if (lockFd >= 0 && ::flock(lockFd, LOCK_EX | LOCK_NB) != 0) {
+                ::close(lockFd);
+                lockFd = -1;
+            }
+        }
         auto loop = std::make_shared<IpcEventLoop>(std::move(options), fd);
-        if (!loop->start(error)) return nullptr;
-        return std::unique_ptr<IpcServer>(new IpcServer(std::move(loop), "", -1));
+        if (!loop->start(error)) {
+            if (lockFd >= 0) ::close(lockFd);
+            return nullptr;
+        }
+        return std::unique_ptr<IpcServer>(new IpcServer(std::move(loop), "", lockFd));
     }
 
     const std::string path = options.path;

@@ -21,6 +21,7 @@
 #include "Client/VSLUpcallClient.h"
 #include "Platform/UniqueFd.h"
 #include "Support/DaemonProcess.h"
+#include "Support/Json.h"
 #include "Support/TempRoot.h"
 #include "Systemd/DatagramListener.h"
 
@@ -100,6 +101,7 @@ public:
         return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
     }
     std::string output() const { return readFile(output_); }
+    pid_t pid() const { return pid_; }
 
 private:
     pid_t pid_ = -1;
@@ -157,6 +159,11 @@ TEST(SocketActivationTest, ServesOnPassedSocketsAndAnswersRequestsSentBeforeRead
     auto ctl = root.run(vesselctlPath(), {"createOrLookup", "Identifier=com.example.activated", "ContainerClass=2",
                                           "CreateIfNecessary=true"});
     EXPECT_EQ(1u, ctl.code()) << ctl.err;
+    // The socket's peer is the service manager; status must still name the daemon.
+    auto status = root.run(vesselctlPath(), {"status", "--json"});
+    auto json = parseJson(status.out);
+    ASSERT_TRUE(json && json->find("Pid")) << status.out;
+    EXPECT_EQ(static_cast<int64_t>(daemon.pid()), json->find("Pid")->int64Value().value_or(-1)) << status.out;
 
     EXPECT_EQ(0, daemon.stop());
     EXPECT_TRUE(notify.waitFor("STOPPING=1", std::chrono::seconds(5)));
