@@ -21,6 +21,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "Daemon/CodeSigning/VSLCallerEntitlementsCache.h"
 #include "Daemon/CodeSigning/VSLCodeSigningEntry.h"
 #include "Daemon/CodeSigning/VSLSQLiteDB.h"
 #include "Daemon/Concurrency/VSLCommandQueue.h"
@@ -181,6 +182,7 @@ private:
     std::shared_ptr<WorkQueue> queue_;
     std::unique_ptr<VSLSQLiteDB> codeSigningMappingDB_;
     std::shared_ptr<VSLUserIdentityCache> userIdentityCache_;
+    VSLCallerEntitlementsCache callerEntitlements_;
 };
 
 }  // namespace vsl

@@ -5,6 +5,8 @@
 // process: the daemon does not run without its database.
 #pragma once
 
+#include <atomic>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -41,6 +43,9 @@ public:
 
     void closeDB();
     const std::string& url() const { return url_; }
+    // Moves before every write (and on close), so an answer read at one generation is
+    // still the stored one while the generation stays; readable from any thread.
+    uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
 
     // Insert or update the row, its data and its child rows, in one transaction.
     bool addCodeSigningEntry(const VSLCodeSigningEntry* entry, const std::optional<std::string>& identifier,
@@ -82,6 +87,7 @@ private:
     sqlite3* db_;
     std::string url_;
     std::unique_ptr<VSLSQLiteStatementCache> statements_;
+    std::atomic<uint64_t> generation_{1};
 };
 
 }  // namespace vsl
