@@ -11,6 +11,7 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdio>
 #include <cstdlib>
 #include <memory>
 #include <string>
@@ -76,6 +77,19 @@ public:
     }
     const std::shared_ptr<vsl::client::VSLConnection>& connection() const { return connection_; }
     const std::string& root() const { return root_; }
+    pid_t pid() const { return pid_; }
+    // The daemon's resident set in KiB, or -1.
+    long residentKiB() const {
+        std::string path = "/proc/" + std::to_string(pid_) + "/status";
+        FILE* f = std::fopen(path.c_str(), "re");
+        if (!f) return -1;
+        char line[256];
+        long kib = -1;
+        while (std::fgets(line, sizeof line, f))
+            if (std::sscanf(line, "VmRSS: %ld", &kib) == 1) break;
+        std::fclose(f);
+        return kib;
+    }
 
 private:
     std::string root_;
