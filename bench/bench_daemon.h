@@ -18,6 +18,7 @@
 #include <thread>
 
 #include "Client/VSLConnection.h"
+#include "bench_table.h"
 #include "Daemon/Core/VSLPropertyListFile.h"
 
 namespace vslbench {
@@ -79,17 +80,7 @@ public:
     const std::string& root() const { return root_; }
     pid_t pid() const { return pid_; }
     // The daemon's resident set in KiB, or -1.
-    long residentKiB() const {
-        std::string path = "/proc/" + std::to_string(pid_) + "/status";
-        FILE* f = std::fopen(path.c_str(), "re");
-        if (!f) return -1;
-        char line[256];
-        long kib = -1;
-        while (std::fgets(line, sizeof line, f))
-            if (std::sscanf(line, "VmRSS: %ld", &kib) == 1) break;
-        std::fclose(f);
-        return kib;
-    }
+    long residentKiB() const { return vslbench::residentKiB(std::to_string(pid_)); }
 
 private:
     std::string root_;

@@ -47,6 +47,18 @@ inline void printFigure(const std::string& name, double value, const char* unit,
     std::exit(2);
 }
 
+// A process's resident set in KiB ("self" or a pid), or -1.
+inline long residentKiB(const std::string& pid = "self") {
+    FILE* f = std::fopen(("/proc/" + pid + "/status").c_str(), "re");
+    if (!f) return -1;
+    char line[256];
+    long kib = -1;
+    while (std::fgets(line, sizeof line, f))
+        if (std::sscanf(line, "VmRSS: %ld", &kib) == 1) break;
+    std::fclose(f);
+    return kib;
+}
+
 // Whether a program the floor needs is on PATH.
 inline bool haveProgram(const char* name) {
     return std::system((std::string("command -v ") + name + " >/dev/null 2>&1").c_str()) == 0;

@@ -86,16 +86,4 @@ inline size_t bareScan(const std::string& classDir, bool decode) {
 // retained pages.
 inline size_t heapInUse() { return mallinfo2().uordblks + mallinfo2().hblkhd; }
 
-// The process's resident set, in KiB.
-inline long residentKiB() {
-    FILE* f = std::fopen("/proc/self/status", "re");
-    if (!f) return -1;
-    char line[256];
-    long kib = -1;
-    while (std::fgets(line, sizeof line, f))
-        if (std::sscanf(line, "VmRSS: %ld", &kib) == 1) break;
-    std::fclose(f);
-    return kib;
-}
-
 }  // namespace cachebench

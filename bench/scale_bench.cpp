@@ -109,7 +109,7 @@ int main(int argc, char** argv) {
         size_t before = cachebench::heapInUse();
         auto cache = rebuild();
         f.bytesPerContainer = static_cast<double>(cachebench::heapInUse() - before) / count;
-        f.residentKiB = cachebench::residentKiB();
+        f.residentKiB = vslbench::residentKiB();
 
         std::mt19937 random(42);
         std::vector<VSLContainerIdentityRef> wanted;

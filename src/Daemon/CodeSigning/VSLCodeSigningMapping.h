@@ -150,7 +150,8 @@ private:
         const std::vector<std::shared_ptr<const VSLMetadata>>& containers, VSLContainerClass containerClass);
     // Stored entry; not found is none without a log, other errors are logged.
     std::optional<VSLCodeSigningEntry> _onQueue_codeSigningEntryForIdentifier(const std::string& identifier,
-                                                                              VSLErrorRef* error);
+                                                                              VSLErrorRef* error,
+                                                                              bool withChildren = true);
     std::optional<Value> _onQueue_entitlementsForIdentifier(const std::string& identifier);
     uint64_t _onQueue_processCodeSigningInfo(const std::optional<Value>& codeSigningInfo,
                                              const std::optional<std::string>& identifier,

@@ -247,7 +247,7 @@ uint64_t VSLCodeSigningMapping::processCallerRegisteredEntitlements(
     queue_->sync([&] {
         const uint64_t generation = codeSigningMappingDB_->generation();
         VSLErrorRef error;
-        auto entry = _onQueue_codeSigningEntryForIdentifier(*identifier, &error);
+        auto entry = _onQueue_codeSigningEntryForIdentifier(*identifier, &error, false);
         if (!entry && error && !isNotInDatabase(error)) {
             result = codeForError(error, kVSLErrorDatabase);
             return;

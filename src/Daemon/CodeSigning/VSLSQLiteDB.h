@@ -52,9 +52,10 @@ public:
                              VSLErrorRef* error);
     // Removes the row with its data and child rows; an identifier not stored fails.
     bool deleteCodeSigningEntryWithIdentifier(const std::optional<std::string>& identifier, VSLErrorRef* error);
-    // Not stored: none with a code-67 error.
+    // Not stored: none with a code-67 error. `withChildren` false leaves the child
+    // bundle identifiers unread (none), for readers that do not look at them.
     std::optional<VSLCodeSigningEntry> codeSigningEntryWithIdentifier(const std::string& identifier,
-                                                                      VSLErrorRef* error);
+                                                                      VSLErrorRef* error, bool withChildren = true);
     bool invalidateCodeSigningWithIdentifier(const std::string& identifier, VSLErrorRef* error);
     bool invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, VSLErrorRef* error);
     // Calls `block` for every stored entry; returns the last error met, or none.
@@ -83,6 +84,8 @@ private:
                                    const char* textOneFailureFormat, const std::string* textTwo, int expectedChanges,
                                    VSLErrorRef* error);
     std::optional<VSLCodeSigningEntry> _codeSigningEntryFromStatementRow(sqlite3_stmt* statement, VSLErrorRef* error);
+    // Appends the children of `parent` (none is not an error).
+    bool _childIdentifiers(const std::string& parent, std::vector<std::string>* children, VSLErrorRef* error);
 
     sqlite3* db_;
     std::string url_;
