@@ -17,7 +17,7 @@ inline void printHeaderOnce() {
     static bool printed = false;
     if (printed) return;
     printed = true;
-    std::printf("%-46s %16s %16s %7s  %s\n", "name", "value", "floor", "ratio", "target");
+    std::printf("%-54s %14s %14s %7s  %s\n", "name", "value", "floor", "ratio", "target");
 }
 
 inline std::string withUnit(double v, const char* unit) {
@@ -29,7 +29,7 @@ inline std::string withUnit(double v, const char* unit) {
 // `target` reads as a bound on the ratio, e.g. "<= 1.3" or ">= 0.8".
 inline void printRow(const std::string& name, double value, double floor, const char* unit, const char* target) {
     printHeaderOnce();
-    std::printf("%-46s %16s %16s %7.2f  %s\n", name.c_str(), withUnit(value, unit).c_str(),
+    std::printf("%-54s %14s %14s %7.2f  %s\n", name.c_str(), withUnit(value, unit).c_str(),
                 withUnit(floor, unit).c_str(), value / floor, target);
     std::fflush(stdout);
 }
@@ -37,7 +37,7 @@ inline void printRow(const std::string& name, double value, double floor, const 
 // A figure with no floor of its own; `target` in the figure's unit.
 inline void printFigure(const std::string& name, double value, const char* unit, const char* target) {
     printHeaderOnce();
-    std::printf("%-46s %16s %16s %7s  %s\n", name.c_str(), withUnit(value, unit).c_str(), "-", "-", target);
+    std::printf("%-54s %14s %14s %7s  %s\n", name.c_str(), withUnit(value, unit).c_str(), "-", "-", target);
     std::fflush(stdout);
 }
 
