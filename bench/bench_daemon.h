@@ -11,12 +11,14 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <cstdio>
 #include <cstdlib>
 #include <memory>
 #include <string>
 #include <thread>
 
 #include "Client/VSLConnection.h"
+#include "bench_table.h"
 #include "Daemon/Core/VSLPropertyListFile.h"
 
 namespace vslbench {
@@ -76,6 +78,9 @@ public:
     }
     const std::shared_ptr<vsl::client::VSLConnection>& connection() const { return connection_; }
     const std::string& root() const { return root_; }
+    pid_t pid() const { return pid_; }
+    // The daemon's resident set in KiB, or -1.
+    long residentKiB() const { return vslbench::residentKiB(std::to_string(pid_)); }
 
 private:
     std::string root_;

@@ -4,7 +4,10 @@
 //  - the creation of a new data container (command 0) vs the bare system-call
 //    sequence it needs (mkdir of the skeleton, metadata written to a temporary file,
 //    fsync, rename, directory fsync);
-//  - lookups per second with 4 concurrent clients.
+//  - lookups per second with 4, 16 and 64 concurrent clients, each looking up its
+//    own container, vs a bare echo server (a thread per connection, in a process of
+//    its own) answering the same frames to the same number of clients;
+//  - the daemon's resident set once started and idle.
 // Starts a real vesseld (next to this program's build tree) on a scratch root and
 // registers this program in its policy store.
 //
@@ -19,6 +22,8 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <atomic>
+#include <functional>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -28,6 +33,8 @@
 #include <vector>
 
 #include "bench_daemon.h"
+#include "bench_socket.h"
+#include "bench_table.h"
 #include "Client/VSLConnection.h"
 #include "Platform/IpcWire.h"
 
@@ -133,6 +140,25 @@ double bareCreateMicros(const std::string& dir, int n) {
     return median(samples);
 }
 
+// Requests per second of `clients` threads sharing `total` round trips of `one`.
+template <class MakeClient>
+double throughput(int clients, int total, MakeClient&& makeClient) {
+    std::vector<std::function<void()>> each;
+    for (int k = 0; k < clients; k++) each.push_back(makeClient(k));
+    std::atomic<bool> go{false};
+    std::vector<std::thread> threads;
+    const int per = std::max(1, total / clients);
+    for (auto& one : each)
+        threads.emplace_back([&] {
+            while (!go.load()) std::this_thread::yield();
+            for (int i = 0; i < per; i++) one();
+        });
+    auto t0 = Clock::now();
+    go = true;
+    for (auto& t : threads) t.join();
+    return per * clients / (usSince(t0) / 1e6);
+}
+
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -149,14 +175,18 @@ int main(int argc, char** argv) {
         auto r = conn->sendRequest(req, std::chrono::seconds(30));
         return r.ok() && r.body.find("ReplyError")->uint64Value() == 1u;
     };
+    auto lookupOf = [](const std::string& identifier, bool create) {
+        return dict({{"Command", Value::uint64(0)},
+                     {"Identifier", Value::string(identifier)},
+                     {"ContainerClass", Value::uint64(2)},
+                     {"CreateIfNecessary", Value::boolean(create)}});
+    };
 
     Value personas = dict({{"Command", Value::uint64(32)}});
-    Value create = dict({{"Command", Value::uint64(0)},
-                         {"Identifier", Value::string("com.example.bench.app")},
-                         {"ContainerClass", Value::uint64(2)},
-                         {"CreateIfNecessary", Value::boolean(true)}});
     for (int i = 0; i < 200; i++) call(c, personas);  // warm up
-    if (!call(c, create)) {
+    std::this_thread::sleep_for(std::chrono::seconds(1));
+    const long idleKiB = daemon.residentKiB();
+    if (!call(c, lookupOf("com.example.bench.app", true))) {
         std::fprintf(stderr, "create failed\n");
         return 1;
     }
@@ -167,9 +197,7 @@ int main(int argc, char** argv) {
         call(c, personas);
         s32.push_back(usSince(t));
     }
-    Value lookup = dict({{"Command", Value::uint64(0)},
-                         {"Identifier", Value::string("com.example.bench.app")},
-                         {"ContainerClass", Value::uint64(2)}});
+    Value lookup = lookupOf("com.example.bench.app", false);
     for (int i = 0; i < n; i++) {
         auto t = Clock::now();
         call(c, lookup);
@@ -182,10 +210,7 @@ int main(int argc, char** argv) {
     int creations = std::max(50, n / 50);
     std::vector<double> sCreate;
     for (int i = 0; i < creations; i++) {
-        Value fresh = dict({{"Command", Value::uint64(0)},
-                            {"Identifier", Value::string("com.example.bench.new" + std::to_string(i))},
-                            {"ContainerClass", Value::uint64(2)},
-                            {"CreateIfNecessary", Value::boolean(true)}});
+        Value fresh = lookupOf("com.example.bench.new" + std::to_string(i), true);
         auto t = Clock::now();
         call(c, fresh);
         sCreate.push_back(usSince(t));
@@ -194,28 +219,62 @@ int main(int argc, char** argv) {
     mkdir(bareDir.c_str(), 0755);
     double bareCreate = bareCreateMicros(bareDir, creations);
 
-    const int clients = 4;
-    std::vector<std::thread> threads;
-    std::vector<int> done(clients, 0);
-    auto t0 = Clock::now();
-    for (int k = 0; k < clients; k++)
-        threads.emplace_back([&, k] {
+    // Many clients, each with its own container, against a bare echo server with as
+    // many clients in the same run.
+    const int counts[] = {4, 16, 64};
+    for (int k = 0; k < 64; k++)
+        if (!call(c, lookupOf("com.example.bench.client" + std::to_string(k), true))) {
+            std::fprintf(stderr, "create failed\n");
+            return 1;
+        }
+    const std::string requestFrame = *encodeFrame(1, 0, lookup);
+    std::string replyFrame(4 + rep, 'r');
+    const uint32_t replyLength = static_cast<uint32_t>(rep);
+    std::memcpy(replyFrame.data(), &replyLength, 4);
+    const std::string echoPath = root + "/many-echo.sock";
+    pid_t echoServer = fork();
+    if (echoServer == 0) {
+        vslbench::RawEchoServer server(echoPath, replyFrame);
+        pause();
+        _exit(0);
+    }
+    for (int i = 0; i < 400 && access(echoPath.c_str(), F_OK) != 0; i++)
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    const int total = std::max(2000, n * 2);
+    std::vector<std::pair<double, double>> many;
+    for (int clients : counts) {
+        double ours = throughput(clients, total, [&](int k) {
             auto conn = client::VSLConnection::connect(socketPath, nullptr);
-            for (int i = 0; i < n / 2; i++) done[k] += call(conn, lookup) ? 1 : 0;
+            Value mine = lookupOf("com.example.bench.client" + std::to_string(k), false);
+            return std::function<void()>([conn, mine, &call] {
+                if (!call(conn, mine)) {
+                    std::fprintf(stderr, "lookup failed\n");
+                    std::exit(1);
+                }
+            });
         });
-    for (auto& t : threads) t.join();
-    double seconds = usSince(t0) / 1e6;
-    int total = 0;
-    for (int d : done) total += d;
+        double floor = throughput(clients, total, [&](int) {
+            int fd = vslbench::connectTo(echoPath);
+            return std::function<void()>([fd, &requestFrame, &replyFrame] {
+                std::string in(replyFrame.size(), '\0');
+                if (!vslbench::writeAll(fd, requestFrame.data(), requestFrame.size()) ||
+                    !vslbench::readAll(fd, in.data(), in.size())) {
+                    std::fprintf(stderr, "echo failed\n");
+                    std::exit(1);
+                }
+            });
+        });
+        many.emplace_back(ours, floor);
+    }
+    kill(echoServer, SIGKILL);
+    waitpid(echoServer, nullptr, 0);
 
-    std::printf("command 32 round trip      %8.1f us   ratio to bare echo %5.2f\n", median(s32), median(s32) / echo);
-    std::printf("lookup (existing) over IPC %8.1f us   ratio to bare echo %5.2f  (target <= 2)\n", median(sLookup),
-                median(sLookup) / echo);
-    std::printf("bare echo (floor)          %8.1f us\n", echo);
-    std::printf("create data container      %8.1f us   ratio to bare syscalls %5.2f  (target <= 2)\n",
-                median(sCreate), median(sCreate) / bareCreate);
-    std::printf("bare create (floor)        %8.1f us\n", bareCreate);
-    std::printf("lookups/s, %d clients       %8.0f\n", clients, total / seconds);
-
+    vslbench::printRow("command 32 round trip / bare echo", median(s32), echo, "us", "(none)");
+    vslbench::printRow("lookup (existing) over IPC / bare echo", median(sLookup), echo, "us", "<= 1.3");
+    vslbench::printRow("create data container / bare syscalls", median(sCreate), bareCreate, "us", "<= 1.3");
+    for (size_t i = 0; i < many.size(); i++)
+        vslbench::printRow("lookups/s, " + std::to_string(counts[i]) + " clients / bare echo server", many[i].first,
+                           many[i].second, "/s", ">= 0.7");
+    vslbench::printFigure("idle resident set", idleKiB / 1024.0, "MiB", "<= 6 MiB");
     return 0;
 }

@@ -14,6 +14,8 @@
 #include <string>
 #include <vector>
 
+#include "bench_table.h"
+
 namespace fsbench {
 
 constexpr int kTopDirs = 50, kSubDirs = 10, kFilesPerDir = 100;  // 50,000 files, 550 directories
@@ -77,18 +79,11 @@ inline std::string runs(const std::vector<double>& v) {
     return s;
 }
 
-inline void printRatio(const char* what, double ours, double reference, const char* referenceName) {
-    std::printf("%s: vesseld %.1f ms, %s %.1f ms\n", what, ours, referenceName, reference);
-    std::printf("ratio %s vesseld/%s = %.2f\n", what, referenceName, ours / reference);
-}
-
-// Medians of both sides, every run, and the ratio line.
-inline void printRatio(const char* what, const std::vector<double>& ours, const std::vector<double>& reference,
-                       const char* referenceName) {
-    double a = median(ours), b = median(reference);
-    std::printf("%s: vesseld %.1f ms [runs %s], %s %.1f ms [runs %s]\n", what, a, runs(ours).c_str(), referenceName,
-                b, runs(reference).c_str());
-    std::printf("ratio %s vesseld/%s = %.2f\n", what, referenceName, a / b);
+// The table row of a timed comparison: medians of both sides, every run on stderr.
+inline void printRatio(const char* name, const std::vector<double>& ours, const std::vector<double>& floor,
+                       const char* target) {
+    std::fprintf(stderr, "%s: runs [%s] ms, floor runs [%s] ms\n", name, runs(ours).c_str(), runs(floor).c_str());
+    vslbench::printRow(name, median(ours), median(floor), "ms", target);
 }
 
 }  // namespace fsbench

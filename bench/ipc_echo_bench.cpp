@@ -24,6 +24,7 @@
 #include "Platform/IpcServer.h"
 #include "Platform/IpcWire.h"
 #include "bench_socket.h"
+#include "bench_table.h"
 
 using namespace vsl;
 using Clock = std::chrono::steady_clock;
@@ -89,12 +90,6 @@ Result measure(const std::function<std::function<void()>()>& makeClient, int rou
     return {single[kRuns / 2], aggregate[kRuns / 2]};
 }
 
-void print(const char* name, const Result& r, const Result& floor) {
-    std::printf("%-28s %8.1f us/round trip  (x%.2f)   %9.0f req/s with %d clients  (x%.2f)\n", name,
-                r.microsPerRoundTrip, r.microsPerRoundTrip / floor.microsPerRoundTrip, r.aggregatePerSecond,
-                kClients, floor.aggregatePerSecond / r.aggregatePerSecond);
-}
-
 }  // namespace
 
 int main(int argc, char** argv) {
@@ -104,7 +99,7 @@ int main(int argc, char** argv) {
     const std::string dir = dirTemplate;
     const std::string requestFrame = *encodeFrame(1, 0, request());
     const std::string replyFrame = *encodeFrame(1, kIpcFlagReply, reply());
-    std::printf("request frame %zu bytes, reply frame %zu bytes, %d round trips per run, median of %d runs\n",
+    std::fprintf(stderr, "request frame %zu bytes, reply frame %zu bytes, %d round trips per run, median of %d runs\n",
                 requestFrame.size(), replyFrame.size(), roundTrips, kRuns);
 
     Result floor;
@@ -151,8 +146,10 @@ int main(int argc, char** argv) {
             roundTrips);
     }
 
-    print("raw blocking echo (floor)", floor, floor);
-    print("IpcServer + VSLConnection", ipc, floor);
+    vslbench::printRow("IpcServer round trip / raw blocking echo", ipc.microsPerRoundTrip, floor.microsPerRoundTrip,
+                       "us", "(none)");
+    vslbench::printRow("IpcServer, 8 clients / raw echo, 8 clients", ipc.aggregatePerSecond,
+                       floor.aggregatePerSecond, "/s", ">= 0.8");
     ::unlink((dir + "/raw").c_str());
     ::unlink((dir + "/ipc.lock").c_str());
     ::rmdir(dir.c_str());

@@ -1,8 +1,9 @@
-// Reply latency of deleting a container that holds 50,000 files, against `rm -rf` of
-// the same tree: the reply comes after a rename into death row, not after the
-// removal. Starts a real vesseld on a scratch root (see daemon_roundtrip_bench).
+// Reply latency of deleting a container that holds 100,000 files, against the reply
+// for one of 1,000 files in the same run: the reply comes after a rename into death
+// row, not after the removal, so it must not grow with the container. Starts a real
+// vesseld on a scratch root (see daemon_roundtrip_bench).
 //
-//   stage_delete_bench [files, default 50000]
+//   stage_delete_bench [files, default 100000]
 #include <fcntl.h>
 #include <limits.h>
 #include <signal.h>
@@ -10,6 +11,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cstdio>
 #include <cstdlib>
@@ -17,6 +19,7 @@
 #include <thread>
 
 #include "bench_daemon.h"
+#include "bench_table.h"
 
 using namespace vsl;
 using Clock = std::chrono::steady_clock;
@@ -41,38 +44,40 @@ double msSince(Clock::time_point t) { return std::chrono::duration<double, std::
 }  // namespace
 
 int main(int argc, char** argv) {
-    int files = argc > 1 ? std::atoi(argv[1]) : 50000;
+    int files = argc > 1 ? std::max(1000, std::atoi(argv[1])) : 100000;
     vslbench::BenchDaemon daemon;
     if (!daemon.start()) return 1;
     const auto& c = daemon.connection();
-    const std::string& root = daemon.root();
-    auto r = c->sendRequest(dict({{"Command", Value::uint64(0)},
-                                  {"Identifier", Value::string("com.example.big")},
-                                  {"ContainerClass", Value::uint64(2)},
-                                  {"CreateIfNecessary", Value::boolean(true)}}),
-                            std::chrono::seconds(30));
-    if (!r.ok() || !r.body.find("ReplyPath")) return 1;
-    std::string path = *r.body.find("ReplyPath")->stringValue();
-    fillTree(path + "/Documents", files);
-    std::string twin = root + "/twin";
-    mkdir(twin.c_str(), 0755);
-    fillTree(twin, files);
-    sync();
-
-    auto t = Clock::now();
-    auto d = c->sendRequest(dict({{"Command", Value::uint64(10)},
-                                  {"Identifier", Value::string("com.example.big")},
-                                  {"ContainerClass", Value::uint64(2)}}),
-                            std::chrono::seconds(600));
-    double reply = msSince(t);
-    // Let death row finish before measuring rm, so the two do not share the disk.
-    c->sendRequest(dict({{"Command", Value::uint64(4)}}), std::chrono::seconds(600));
-    t = Clock::now();
-    std::system(("rm -rf '" + twin + "'").c_str());
-    double rm = msSince(t);
-    std::printf("delete reply (%d files)   %10.2f ms  (code %llu)\n", files, reply,
-                (unsigned long long)d.body.find("ReplyError")->uint64Value().value_or(0));
-    std::printf("rm -rf of the same tree   %10.2f ms\n", rm);
-    std::printf("ratio reply / rm -rf      %10.4f\n", reply / rm);
+    auto request = [&](uint64_t command, const std::string& identifier, bool create) {
+        return c->sendRequest(dict({{"Command", Value::uint64(command)},
+                                    {"Identifier", Value::string(identifier)},
+                                    {"ContainerClass", Value::uint64(2)},
+                                    {"CreateIfNecessary", Value::boolean(create)}}),
+                              std::chrono::seconds(600));
+    };
+    // Times the delete reply of a container holding `count` files, then lets death
+    // row finish so that the next measure does not share the disk with it.
+    auto deleteReply = [&](const std::string& identifier, int count) {
+        auto r = request(0, identifier, true);
+        if (!r.ok() || !r.body.find("ReplyPath")) {
+            std::fprintf(stderr, "create failed\n");
+            std::exit(1);
+        }
+        fillTree(*r.body.find("ReplyPath")->stringValue() + "/Documents", count);
+        sync();
+        auto t = Clock::now();
+        auto d = request(10, identifier, false);
+        double ms = msSince(t);
+        if (!d.ok() || d.body.find("ReplyError")->uint64Value().value_or(0) != 1) {
+            std::fprintf(stderr, "delete failed\n");
+            std::exit(1);
+        }
+        c->sendRequest(dict({{"Command", Value::uint64(4)}}), std::chrono::seconds(600));
+        return ms;
+    };
+    double small = deleteReply("com.example.small", 1000);
+    double big = deleteReply("com.example.big", files);
+    vslbench::printRow("delete reply, " + std::to_string(files / 1000) + "k files / 1k files", big, small, "ms",
+                       "<= 1.2");
     return 0;
 }

@@ -15,6 +15,7 @@
 #include "Client/VSLUpcallProtocol.h"
 #include "bench_daemon.h"
 #include "bench_socket.h"
+#include "bench_table.h"
 
 using namespace vsl;
 using namespace vsl::client;
@@ -102,10 +103,8 @@ int main(int argc, char** argv) {
         roundTrips);
     ::close(fd);
 
-    std::printf("request frame %zu bytes, reply frame %zu bytes, %d round trips per run, median of %d runs\n",
-                requestFrame.size(), replyFrame.size(), roundTrips, kRuns);
-    std::printf("%-34s %8.1f us/round trip\n", "bare echo (floor)", floorMicros);
-    std::printf("%-34s %8.1f us/round trip  (x%.2f)\n", "upcall, existing containers", daemonMicros,
-                daemonMicros / floorMicros);
+    std::fprintf(stderr, "request frame %zu bytes, reply frame %zu bytes, %d round trips per run, median of %d runs\n",
+                 requestFrame.size(), replyFrame.size(), roundTrips, kRuns);
+    vslbench::printRow("upcall, existing containers / bare echo", daemonMicros, floorMicros, "us", "(none)");
     return 0;
 }

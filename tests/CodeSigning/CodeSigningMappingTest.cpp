@@ -2,6 +2,9 @@
 // staged containers followed onto death row.
 #include <gtest/gtest.h>
 
+#include <chrono>
+#include <future>
+
 #include "CodeSigning/CodeSigningTestSupport.h"
 #include "Daemon/Concurrency/VSLCommandQueue.h"
 
@@ -270,4 +273,47 @@ TEST_F(CodeSigningTest, EntriesWithoutABundleContainerAreInvalidatedAndCachedInf
     EXPECT_EQ(Value::string("T1"), *imported->codeSigningInfo->find("TeamIdentifier"));
     EXPECT_EQ(1u, log_.count("Migrating code signing info from bundle container upon request for legacy"));
     EXPECT_FALSE(mapping_->entitlementsForIdentifier("unknown"));
+}
+
+// Every message checks its sender's own entitlements; an unchanged sender must not
+// wait for the code-signing queue (held here by a suspension, as by other clients'
+// database work), while any change to the stored entry is still seen at once.
+TEST_F(CodeSigningTest, AnUnchangedCallerIsCheckedWithoutTheQueueAndAStoredChangeIsSeen) {
+    auto queue = VSLCommandQueue::create();
+    Value ents = dict({{"com.example.flag", Value::boolean(true)}});
+    ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(infoWithEntitlements(ents), "com.example.installed",
+                                                            std::nullopt, queue));
+    // The first check registers the client; the next ones find it stored.
+    ASSERT_EQ(kVSLSuccess, mapping_->processCallerRegisteredEntitlements(ents, "com.example.client", queue));
+    ASSERT_EQ(kVSLSuccess, mapping_->processCallerRegisteredEntitlements(ents, "com.example.client", queue));
+    ASSERT_EQ(kVSLSuccess, mapping_->processCallerRegisteredEntitlements(dict({}), "com.example.installed", queue));
+
+    auto checkWhileQueueHeld = [&](const Value& given, const char* identifier) {
+        mapping_->queue()->suspend();
+        auto done = std::async(std::launch::async, [&] {
+            return mapping_->processCallerRegisteredEntitlements(given, std::string(identifier), queue);
+        });
+        bool answered = done.wait_for(std::chrono::seconds(5)) == std::future_status::ready;
+        mapping_->queue()->resume();
+        EXPECT_EQ(kVSLSuccess, done.get());
+        return answered;
+    };
+    EXPECT_TRUE(checkWhileQueueHeld(ents, "com.example.client"));
+    EXPECT_TRUE(checkWhileQueueHeld(dict({}), "com.example.installed")) << "installer-registered entries win";
+    EXPECT_EQ(1u, log_.count("Set Code Signing Mapping for ID: com.example.client"));
+
+    // An installer's registration replaces the client's own: the next check must read it.
+    Value installed = dict({{"com.example.flag", Value::boolean(false)}});
+    ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(infoWithEntitlements(installed), "com.example.client",
+                                                            std::nullopt, queue));
+    EXPECT_EQ(kVSLSuccess, mapping_->processCallerRegisteredEntitlements(ents, "com.example.client", queue));
+    EXPECT_EQ(installed, mapping_->entitlementsForIdentifier("com.example.client"));
+    // Removed, the client registers itself again.
+    ASSERT_EQ(kVSLSuccess, mapping_->processCodeSigningInfo(std::nullopt, "com.example.client", std::nullopt, queue));
+    EXPECT_EQ(kVSLSuccess, mapping_->processCallerRegisteredEntitlements(ents, "com.example.client", queue));
+    EXPECT_EQ(ents, mapping_->entitlementsForIdentifier("com.example.client"));
+    EXPECT_TRUE(mapping_->identifierHasCallerRegisteredEntitlements("com.example.client"));
+    // A changed client re-registers.
+    EXPECT_EQ(kVSLSuccess, mapping_->processCallerRegisteredEntitlements(installed, "com.example.client", queue));
+    EXPECT_EQ(installed, mapping_->entitlementsForIdentifier("com.example.client"));
 }

@@ -11,6 +11,8 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <map>
+#include <sstream>
 #include <future>
 #include <thread>
 
@@ -356,4 +358,53 @@ TEST(Protection, NewDataContainersTakeTheClassTheirEntitlementsName) {
         EXPECT_EQ(0, classOf(made.path + "/SystemData")) << k.identifier;
     }
     EXPECT_TRUE(waitForLog(daemon, "Unknown value for DataProtectionClass entitlement: complete; defaulting to class 0"));
+}
+
+// The walk reads each entry's class first: an entry already at the new class is not
+// written (its ctime stays), every entry that changes class is written once.
+TEST(Protection, TheWalkWritesOnlyEntriesWhoseClassDiffers) {
+    DaemonProcess daemon;
+    registerSelf(daemon);
+    const std::string trace = daemon.at("durable.trace");
+    ASSERT_TRUE(daemon.start({"VESSELD_DURABLE_TRACE=" + trace})) << readFile(daemon.at("vesseld.stderr"));
+    auto c = connectTo(daemon);
+    ASSERT_TRUE(c);
+    Created app = createContainer(*c, kApp, 2);
+    ASSERT_FALSE(app.path.empty());
+    const std::string p = app.path;
+    std::vector<std::string> files, dirs{p + "/Documents", p + "/Documents/x", p + "/Library", p + "/tmp"};
+    for (const char* f : {"/Documents/a", "/Documents/x/b", "/Library/c", "/tmp/d"}) {
+        makeFile(p + f, 3);
+        files.push_back(p + f);
+    }
+    ASSERT_EQ(1u, protect(daemon, kApp, 3));
+    ASSERT_EQ(1u, protect(daemon, kApp, 1));  // directories and files to class 1
+    ASSERT_EQ(1u, protect(daemon, kApp, 3));  // directories only: the files stay at class 1
+    for (const auto& f : files) ASSERT_EQ(1, classOf(f)) << f;
+    auto ctimeOf = [](const std::string& path) {
+        struct stat st {};
+        ::lstat(path.c_str(), &st);
+        return std::pair(st.st_ctim.tv_sec, st.st_ctim.tv_nsec);
+    };
+    std::map<std::string, std::pair<time_t, long>> before;
+    for (const auto& e : files) before[e] = ctimeOf(e);
+    for (const auto& e : dirs) before[e] = ctimeOf(e);
+    std::this_thread::sleep_for(std::chrono::milliseconds(30));  // ctime comes from a coarse clock
+
+    const size_t traced = readFile(trace).size();
+    ASSERT_EQ(1u, protect(daemon, kApp, 1));
+    std::map<std::string, int> classWrites;  // "<n> xattr <path>" lines of this change
+    std::istringstream lines(readFile(trace).substr(traced));
+    for (std::string n, kind, path; lines >> n >> kind && std::getline(lines >> std::ws, path);)
+        if (kind == "xattr") classWrites[path]++;
+    for (const auto& d : dirs) EXPECT_EQ(1, classWrites[d]) << d << " is written once";
+    for (const auto& f : files) EXPECT_EQ(0, classWrites[f]) << f;
+    for (const auto& f : files) {
+        EXPECT_EQ(1, classOf(f)) << f;
+        EXPECT_EQ(before[f], ctimeOf(f)) << f << " was written though its class was already right";
+    }
+    for (const auto& d : dirs) {
+        EXPECT_EQ(1, classOf(d)) << d;
+        EXPECT_NE(before[d], ctimeOf(d)) << d << " changed class without a write";
+    }
 }

@@ -71,10 +71,10 @@ void VSLCodeSigningMapping::assertOnQueue() const {
 // ---- reading ----
 
 std::optional<VSLCodeSigningEntry> VSLCodeSigningMapping::_onQueue_codeSigningEntryForIdentifier(
-    const std::string& identifier, VSLErrorRef* error) {
+    const std::string& identifier, VSLErrorRef* error, bool withChildren) {
     assertOnQueue();
     VSLErrorRef e;
-    auto entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier, &e);
+    auto entry = codeSigningMappingDB_->codeSigningEntryWithIdentifier(identifier, &e, withChildren);
     if (!entry && e && !isNotInDatabase(e))
         osLog(LogCategory::CodeSignMapping, OSLogLevel::Error, "Error retrieving entry from DB with identifier %@ : %@",
               identifier, e);
@@ -129,12 +129,13 @@ std::optional<Value> VSLCodeSigningMapping::entitlementsForIdentifier(const std:
 std::optional<Value> VSLCodeSigningMapping::getCodeSigningInfoForIdentifier(const std::string& identifier) {
     VSLGlobalWriteLock lock;
     std::optional<VSLCodeSigningEntry> entry;
-    queue_->sync([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr); });
+    // Only the stored information is answered: the children are not read.
+    queue_->sync([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr, false); });
     // Stored entitlements mean there is nothing to import; otherwise look at the bundle
     // container first, then read what that may have stored.
     if (!entry || !entry->entitlements()) {
         entitlementsForIdentifier(identifier);
-        queue_->sync([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr); });
+        queue_->sync([&] { entry = _onQueue_codeSigningEntryForIdentifier(identifier, nullptr, false); });
     }
     if (entry && !entry->placeholder && !entry->advanceCopy && !entry->invalid) return entry->codeSigningInfo;
     return std::nullopt;

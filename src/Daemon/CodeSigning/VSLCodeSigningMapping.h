@@ -21,6 +21,7 @@
 #include <unordered_map>
 #include <vector>
 
+#include "Daemon/CodeSigning/VSLCallerEntitlementsCache.h"
 #include "Daemon/CodeSigning/VSLCodeSigningEntry.h"
 #include "Daemon/CodeSigning/VSLSQLiteDB.h"
 #include "Daemon/Concurrency/VSLCommandQueue.h"
@@ -149,7 +150,8 @@ private:
         const std::vector<std::shared_ptr<const VSLMetadata>>& containers, VSLContainerClass containerClass);
     // Stored entry; not found is none without a log, other errors are logged.
     std::optional<VSLCodeSigningEntry> _onQueue_codeSigningEntryForIdentifier(const std::string& identifier,
-                                                                              VSLErrorRef* error);
+                                                                              VSLErrorRef* error,
+                                                                              bool withChildren = true);
     std::optional<Value> _onQueue_entitlementsForIdentifier(const std::string& identifier);
     uint64_t _onQueue_processCodeSigningInfo(const std::optional<Value>& codeSigningInfo,
                                              const std::optional<std::string>& identifier,
@@ -181,6 +183,7 @@ private:
     std::shared_ptr<WorkQueue> queue_;
     std::unique_ptr<VSLSQLiteDB> codeSigningMappingDB_;
     std::shared_ptr<VSLUserIdentityCache> userIdentityCache_;
+    VSLCallerEntitlementsCache callerEntitlements_;
 };
 
 }  // namespace vsl

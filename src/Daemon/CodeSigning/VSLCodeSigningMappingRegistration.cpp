@@ -239,20 +239,30 @@ uint64_t VSLCodeSigningMapping::processCallerRegisteredEntitlements(
     const std::shared_ptr<VSLCommandQueue>& commandQueue) {
     if (!identifier || identifier->empty()) return kVSLErrorMissingIdentifier;
     const Value* given = presentValue(entitlements);
+    // Every message of every client comes here: an answer already found costs no
+    // database read and no wait behind other clients on the queue.
+    if (callerEntitlements_.isUnchanged(*identifier, given, codeSigningMappingDB_->generation())) return kVSLSuccess;
     uint64_t result = kVSLSuccess;
     bool reRegister = false;
     queue_->sync([&] {
+        const uint64_t generation = codeSigningMappingDB_->generation();
         VSLErrorRef error;
-        auto entry = _onQueue_codeSigningEntryForIdentifier(*identifier, &error);
+        auto entry = _onQueue_codeSigningEntryForIdentifier(*identifier, &error, false);
         if (!entry && error && !isNotInDatabase(error)) {
             result = codeForError(error, kVSLErrorDatabase);
             return;
         }
         if (entry && entry->codeSigningInfo) {
-            if (!entry->registeredByCaller) return;  // installer-registered information wins
+            if (!entry->registeredByCaller) {  // installer-registered information wins
+                callerEntitlements_.remember(*identifier, given, true, generation);
+                return;
+            }
             const Value* stored = entry->entitlements();
             bool same = stored && given ? propertyListValuesEqual(*stored, *given) : !stored && !given;
-            if (same) return;
+            if (same) {
+                callerEntitlements_.remember(*identifier, given, false, generation);
+                return;
+            }
             osLog(LogCategory::CodeSignMapping, OSLogLevel::Default, "%@ has changed entitlements. Re-registering.",
                   *identifier);
         }

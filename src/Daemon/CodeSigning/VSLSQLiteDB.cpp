@@ -118,6 +118,7 @@ VSLSQLiteDB::~VSLSQLiteDB() {
 
 void VSLSQLiteDB::closeDB() {
     if (!db_) return;
+    generation_.fetch_add(1, std::memory_order_acq_rel);
     osLog(LogCategory::Database, OSLogLevel::Debug, "closing %@", url_);
     statements_->finalizeAll();
     int rc = sqlite3_close(db_);
@@ -223,6 +224,7 @@ bool VSLSQLiteDB::_performTwoParameterQuery(const char* sql, const char* kind, c
 
 bool VSLSQLiteDB::addCodeSigningEntry(const VSLCodeSigningEntry* entry, const std::optional<std::string>& identifier,
                                       VSLErrorRef* error) {
+    generation_.fetch_add(1, std::memory_order_acq_rel);
     if (!entry || !identifier)
         return failWithError(error,
                              VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true,
@@ -261,6 +263,7 @@ bool VSLSQLiteDB::addCodeSigningEntry(const VSLCodeSigningEntry* entry, const st
 
 bool VSLSQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::optional<std::string>& identifier,
                                                        VSLErrorRef* error) {
+    generation_.fetch_add(1, std::memory_order_acq_rel);
     if (!identifier)
         return failWithError(
             error, VSL_ERROR(kVSLErrorInvalidArgument, nullptr, true, "identifier %@ cannot be nil", identifier));
@@ -273,6 +276,7 @@ bool VSLSQLiteDB::deleteCodeSigningEntryWithIdentifier(const std::optional<std::
 }
 
 bool VSLSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identifier, VSLErrorRef* error) {
+    generation_.fetch_add(1, std::memory_order_acq_rel);
     VSLErrorRef queryError;
     if (_performTwoParameterQuery(kInvalidate, "insert", identifier,
                                   "sqlite3_bind_text for identifier=%@ at %@ failed: %s", nullptr, -1, &queryError))
@@ -282,6 +286,7 @@ bool VSLSQLiteDB::invalidateCodeSigningWithIdentifier(const std::string& identif
 }
 
 bool VSLSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, VSLErrorRef* error) {
+    generation_.fetch_add(1, std::memory_order_acq_rel);
     VSLErrorRef childError;
     auto children = childIdentifiersForParentIdentifier(identifier, &childError);
     if (!children && !errorHasCode(childError, kVSLErrorNotInDatabase))
@@ -313,6 +318,7 @@ bool VSLSQLiteDB::invalidateCodeSigningForIdentifierAndAllChildren(const std::st
 }
 
 bool VSLSQLiteDB::deleteAllAdvanceCopiesOfCodeSigningEntriesWithError(VSLErrorRef* error) {
+    generation_.fetch_add(1, std::memory_order_acq_rel);
     VSLSQLiteStatement statement(*statements_);
     if (!statement.prepare(kDeleteAdvanceCopies, "delete", error)) return false;
     if (sqlite3_bind_int(statement.get(), 1, kFlagAdvanceCopy) != SQLITE_OK)

@@ -5,6 +5,8 @@
 // process: the daemon does not run without its database.
 #pragma once
 
+#include <atomic>
+#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
@@ -41,15 +43,19 @@ public:
 
     void closeDB();
     const std::string& url() const { return url_; }
+    // Moves before every write (and on close), so an answer read at one generation is
+    // still the stored one while the generation stays; readable from any thread.
+    uint64_t generation() const { return generation_.load(std::memory_order_acquire); }
 
     // Insert or update the row, its data and its child rows, in one transaction.
     bool addCodeSigningEntry(const VSLCodeSigningEntry* entry, const std::optional<std::string>& identifier,
                              VSLErrorRef* error);
     // Removes the row with its data and child rows; an identifier not stored fails.
     bool deleteCodeSigningEntryWithIdentifier(const std::optional<std::string>& identifier, VSLErrorRef* error);
-    // Not stored: none with a code-67 error.
+    // Not stored: none with a code-67 error. `withChildren` false leaves the child
+    // bundle identifiers unread (none), for readers that do not look at them.
     std::optional<VSLCodeSigningEntry> codeSigningEntryWithIdentifier(const std::string& identifier,
-                                                                      VSLErrorRef* error);
+                                                                      VSLErrorRef* error, bool withChildren = true);
     bool invalidateCodeSigningWithIdentifier(const std::string& identifier, VSLErrorRef* error);
     bool invalidateCodeSigningForIdentifierAndAllChildren(const std::string& identifier, VSLErrorRef* error);
     // Calls `block` for every stored entry; returns the last error met, or none.
@@ -78,10 +84,13 @@ private:
                                    const char* textOneFailureFormat, const std::string* textTwo, int expectedChanges,
                                    VSLErrorRef* error);
     std::optional<VSLCodeSigningEntry> _codeSigningEntryFromStatementRow(sqlite3_stmt* statement, VSLErrorRef* error);
+    // Appends the children of `parent` (none is not an error).
+    bool _childIdentifiers(const std::string& parent, std::vector<std::string>* children, VSLErrorRef* error);
 
     sqlite3* db_;
     std::string url_;
     std::unique_ptr<VSLSQLiteStatementCache> statements_;
+    std::atomic<uint64_t> generation_{1};
 };
 
 }  // namespace vsl

@@ -62,7 +62,8 @@ std::optional<VSLCodeSigningEntry> VSLSQLiteDB::_codeSigningEntryFromStatementRo
 }
 
 std::optional<VSLCodeSigningEntry> VSLSQLiteDB::codeSigningEntryWithIdentifier(const std::string& identifier,
-                                                                               VSLErrorRef* error) {
+                                                                               VSLErrorRef* error,
+                                                                               bool withChildren) {
     std::optional<VSLCodeSigningEntry> entry;
     {
         VSLSQLiteStatement statement(*statements_);
@@ -87,14 +88,15 @@ std::optional<VSLCodeSigningEntry> VSLSQLiteDB::codeSigningEntryWithIdentifier(c
             return std::nullopt;
         }
     }
+    if (!withChildren) return entry;
+    std::vector<std::string> children;
     VSLErrorRef childError;
-    if (auto children = childIdentifiersForParentIdentifier(identifier, &childError)) {
-        entry->childBundleIdentifiers = std::move(children);
-    } else if (!errorHasCode(childError, kVSLErrorNotInDatabase)) {
+    if (!_childIdentifiers(identifier, &children, &childError)) {
         LogWrite(kLogLevelError, VSL_FUNCTION, "Error retrieving childBundleIds: %@", childError);
         failWithError(error, childError);
         return std::nullopt;
     }
+    if (!children.empty()) entry->childBundleIdentifiers = std::move(children);
     return entry;
 }
 
@@ -140,28 +142,33 @@ std::optional<std::set<std::string>> VSLSQLiteDB::identifiersWithError(VSLErrorR
     }
 }
 
-std::optional<std::vector<std::string>> VSLSQLiteDB::childIdentifiersForParentIdentifier(const std::string& parent,
-                                                                                         VSLErrorRef* error) {
+bool VSLSQLiteDB::_childIdentifiers(const std::string& parent, std::vector<std::string>* children,
+                                    VSLErrorRef* error) {
     VSLSQLiteStatement statement(*statements_);
     if (!statement.prepare(kSelectChildren, "select", error) ||
         !statement.bindText(1, parent, "sqlite3_bind_text for identifier=%@ at %@ failed: %s", error))
-        return std::nullopt;
-    std::vector<std::string> children;
+        return false;
     for (;;) {
         int rc = statement.step();
-        if (rc == SQLITE_DONE) break;
+        if (rc == SQLITE_DONE) return true;
         if (rc != SQLITE_ROW) {
             failWithError(error, statement.stepError());
-            return std::nullopt;
+            return false;
         }
         auto text = columnText(statement.get(), 0);
         if (!text) {
             failWithError(error, VSL_ERROR(kVSLErrorAllocation, nullptr, true,
                                            "Failed to allocate thisChildBundleId for text: %s", "(null)"));
-            return std::nullopt;
+            return false;
         }
-        children.push_back(std::move(*text));
+        children->push_back(std::move(*text));
     }
+}
+
+std::optional<std::vector<std::string>> VSLSQLiteDB::childIdentifiersForParentIdentifier(const std::string& parent,
+                                                                                         VSLErrorRef* error) {
+    std::vector<std::string> children;
+    if (!_childIdentifiers(parent, &children, error)) return std::nullopt;
     if (children.empty()) {
         failWithError(error, VSL_ERROR(kVSLErrorNotInDatabase, nullptr, false,
                                        "Children for parent identifier: \"%@\" Not Found in DB", parent));

@@ -10,12 +10,19 @@
 #include "Platform/SystemRoot.h"
 #include "Platform/WorkQueue.h"
 
+#include <string_view>
+
 namespace vsl {
+
+// Keyed by a view of each record's own identifier: the key costs no copy of the string.
+// A record handed out is never changed, so the view lives as long as its entry, as
+// long as every insertion goes through putRecord.
+using RecordMap = std::unordered_map<std::string_view, VSLMetadataRef>;
 
 struct VSLContainerCache::ClassIndex {
     std::mutex mutex;
     bool built = false;
-    std::unordered_map<std::string, VSLMetadataRef> records;
+    RecordMap records;
 };
 
 namespace {
@@ -25,6 +32,13 @@ namespace {
 const char* const kCodeSigningQueueLabel = "com.tarrow.Vesselry.EntitlementQueue";
 
 void assertNotOnCodeSigningQueue() { VSL_INVARIANT(WorkQueue::currentLabel() != kCodeSigningQueueLabel); }
+
+// Replaces the entry of the record's identifier, its key then viewing the new record.
+void putRecord(RecordMap& records, VSLMetadataRef record) {
+    records.erase(record->identifier());
+    std::string_view key = record->identifier();
+    records.emplace(key, std::move(record));
+}
 
 const char* transientMarker(bool transient) { return transient ? "(transient)" : ""; }
 
@@ -122,7 +136,7 @@ bool VSLContainerCache::_lock_getCache(ClassIndex& index, const std::string& key
     auto entries = VSLFileManager::defaultManager().urlsForItemsInDirectoryAtURL(*directory, error);
     if (!entries) return false;
 
-    std::unordered_map<std::string, VSLMetadataRef> records;
+    RecordMap records;
     records.reserve(entries->size());
     for (const VSLItemURL& entry : *entries) {
         if (!containerURLIsValidForContainerClass(entry.path, containerClass)) continue;
@@ -133,7 +147,7 @@ bool VSLContainerCache::_lock_getCache(ClassIndex& index, const std::string& key
         auto metadata = VSLMetadata::readAndValidateMetadataAtUrl(entry.path, userIdentity, true, &readError,
                                                                   userIdentityCache_.get());
         if (metadata)
-            records[metadata->identifier()] = std::move(metadata);
+            putRecord(records, std::move(metadata));
         else if (isReadFailure(readError)) {
             if (error) *error = std::move(readError);
             return false;
@@ -145,7 +159,7 @@ bool VSLContainerCache::_lock_getCache(ClassIndex& index, const std::string& key
     if (populateSandboxCache && !transient) {
         std::vector<VSLMetadataRef> registered;
         for (const auto& [identifier, metadata] : index.records)
-            if (shouldRegisterSandboxMappingWithUserIdentity(userIdentity, identifier, containerClass))
+            if (shouldRegisterSandboxMappingWithUserIdentity(userIdentity, metadata->identifier(), containerClass))
                 registered.push_back(metadata);
         pushSandboxItems(userIdentity, containerClass, registered);
     }
@@ -367,7 +381,7 @@ bool VSLContainerCache::addContainerMetadata(const VSLMetadataRef& metadata, con
                 if (error) *error = e;
                 return false;
             }
-            index->records[metadata->identifier()] = recordAt(metadata, url);
+            putRecord(index->records, recordAt(metadata, url));
             if (updateSandbox)
                 registers =
                     shouldRegisterSandboxMappingWithUserIdentity(userIdentity, metadata->identifier(), containerClass);
@@ -443,9 +457,10 @@ void VSLContainerCache::invalidateUserIdentity(const VSLUserIdentityRef& userIde
     for (const auto& [containerClass, index] : live) {
         std::lock_guard<std::mutex> lock(index->mutex);
         for (const auto& [identifier, metadata] : index->records)
-            if (!setSandboxContainerMappingForUserIdentity(userIdentity, identifier, containerClass, std::nullopt))
+            if (!setSandboxContainerMappingForUserIdentity(userIdentity, metadata->identifier(), containerClass,
+                                                           std::nullopt))
                 LogWrite(kLogLevelError, VSL_FUNCTION, "Failed to remove container mapping of [%@], class: %llu",
-                         identifier, containerClass);
+                         metadata->identifier(), containerClass);
         index->records.clear();
         index->built = false;
     }
