@@ -1,0 +1,225 @@
+// First start after boot against restarts within one boot, on one root: the first-boot
+// setup and clean-up run once per boot; orphans and transient containers go at first
+// boot only; restored system containers are installed; a new build rolls system
+// container names and migrates.
+#include <gtest/gtest.h>
+#include <fcntl.h>
+#include <linux/fs.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+#include <filesystem>
+#include <string>
+
+#include "Daemon/Core/VSLPropertyListFile.h"
+#include "Platform/UniqueFd.h"
+#include "Platform/Value.h"
+#include "Support/Boot.h"
+#include "Support/DaemonProcess.h"
+#include "Support/RootFiles.h"
+#include "Support/TempRoot.h"
+
+using namespace vsl;
+using namespace vsl::test;
+using client::kCleanupCompleteNotification;
+using client::kRebootCleanupCompleteNotification;
+namespace fs = std::filesystem;
+
+namespace {
+
+const char* const kAllowed = "com.tarrow.private.Vesselry.allowed";
+const char* const kLog = "private/var/root/Library/Logs/Vesselry/vesseld.log";
+const char* const kSystemData = "private/var/containers/Data/System";
+const char* const kSystemGroup = "private/var/containers/Shared/SystemGroup";
+const char* const kUserData = "private/var/mobile/Containers/Data/Application";
+
+std::string deviceFacts(const std::string& entries) {
+    return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>" + entries +
+           "</dict></plist>\n";
+}
+
+size_t occurrences(const std::string& text, const std::string& what) {
+    size_t n = 0;
+    for (size_t at = text.find(what); at != std::string::npos; at = text.find(what, at + 1)) n++;
+    return n;
+}
+
+class Boot : public ::testing::Test {
+protected:
+    void SetUp() override {
+        admin = daemon.addClient("admin", "com.example.admin", dict({{kAllowed, Value::boolean(true)}}));
+        ASSERT_FALSE(admin.empty());
+    }
+    void startAndSettle(bool firstBoot) {
+        ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
+        ASSERT_TRUE(waitForNotification(daemon, kCleanupCompleteNotification));
+        if (firstBoot) {
+            ASSERT_TRUE(waitForNotification(daemon, kRebootCleanupCompleteNotification));
+        }
+    }
+    void rebootAndSettle() {
+        if (daemon.running()) {
+            ASSERT_EQ(0, daemon.stop());
+        }
+        simulateReboot(daemon);
+        startAndSettle(true);
+    }
+    // The container's path, made when missing.
+    std::string container(const std::string& identifier, uint64_t containerClass, bool create = true) {
+        auto r = daemon.run(admin, {"createOrLookup", "Identifier=" + identifier,
+                                    "ContainerClass=" + std::to_string(containerClass),
+                                    std::string("CreateIfNecessary=") + (create ? "true" : "false")});
+        EXPECT_EQ(1u, r.code()) << identifier << " " << r.err;
+        return r.string("ReplyPath");
+    }
+    std::string log() { return readFile(daemon.at(kLog)); }
+
+    DaemonProcess daemon;
+    std::string admin;
+};
+
+const char* const kOrphan = "0A1B2C3D-0000-4000-8000-0000000000AA";
+
+TEST_F(Boot, FirstBootWorkRunsOncePerBootAndItsNotificationFollowsTheOrphanCleanups) {
+    startAndSettle(true);
+    EXPECT_EQ(1u, occurrences(log(), "vesseld performing first boot initialization"));
+    const std::string kept = container("com.example.kept", 2);
+    ASSERT_FALSE(kept.empty());
+    ASSERT_EQ(0, daemon.stop());
+
+    // Left behind: entries without metadata in a per-user and a system class directory,
+    // a transient container's directory.
+    auto plant = [&] {
+        writeRootFile(daemon, std::string(kUserData) + "/" + kOrphan + "/Documents/stray", "x");
+        writeRootFile(daemon, std::string(kSystemData) + "/" + kOrphan + "/stray", "x");
+        writeRootFile(daemon, "private/var/root/Library/Caches/com.tarrow.vesseld/Temp/Data/System/T/file", "x");
+    };
+    plant();
+
+    // A restart within the boot: no first-boot work, the orphans stay.
+    startAndSettle(false);
+    EXPECT_EQ(1u, occurrences(log(), "vesseld performing first boot initialization"));
+    EXPECT_TRUE(fs::exists(daemon.at(std::string(kUserData) + "/" + kOrphan)));
+    EXPECT_TRUE(fs::exists(daemon.at(std::string(kSystemData) + "/" + kOrphan)));
+
+    // After a reboot: orphans and transient containers are gone by the time the
+    // first-boot clean-up reports completion; the container with metadata stays.
+    rebootAndSettle();
+    EXPECT_EQ(2u, occurrences(log(), "vesseld performing first boot initialization"));
+    EXPECT_FALSE(fs::exists(daemon.at(std::string(kUserData) + "/" + kOrphan)));
+    EXPECT_FALSE(fs::exists(daemon.at(std::string(kSystemData) + "/" + kOrphan)));
+    EXPECT_FALSE(fs::exists(daemon.at("private/var/root/Library/Caches/com.tarrow.vesseld/Temp/Data/System/T")));
+    EXPECT_NE(std::string::npos, log().find("Deleting orphaned data missing a metadata file at"));
+    EXPECT_TRUE(fs::exists(kept + "/.com.tarrow.vesselry.metadata.plist"));
+    EXPECT_EQ(kept, container("com.example.kept", 2, false));
+}
+
+TEST_F(Boot, RestoredSystemContainersAreInstalledAndWhatCannotBePlacedIsKept) {
+    // An internal build keeps the backup directory, and so what could not be placed.
+    writeRootFile(daemon, "etc/vesseld/device.plist", deviceFacts("<key>InternalBuild</key><true/>"));
+    startAndSettle(true);
+    const std::string blocked = container("com.example.blocked", 12);
+    ASSERT_FALSE(blocked.empty());
+    writeRootFile(daemon, fs::relative(blocked, daemon.root()).string() + "/Occupied/old", "old");
+    ASSERT_EQ(0, daemon.stop());
+
+    const std::string backup = "private/var/mobile/Library/Backup/SystemContainers";
+    writeRootFile(daemon, backup + "/Data/com.example.restored/Documents/restored.txt", "restored");
+    writeRootFile(daemon, backup + "/Data/com.example.blocked/Occupied/new", "new");
+    writeRootFile(daemon, backup + "/Shared/systemgroup.com.example.restored/Shared.txt", "shared");
+    // The blocked container's entries cannot be removed, so its restored child cannot
+    // take their place.
+    UniqueFd fd(::open(blocked.c_str(), O_RDONLY | O_DIRECTORY));
+    unsigned flags = 0;
+    ASSERT_EQ(0, ::ioctl(fd.get(), FS_IOC_GETFLAGS, &flags));
+    flags |= FS_APPEND_FL;
+    ASSERT_EQ(0, ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags));
+
+    simulateReboot(daemon);
+    startAndSettle(true);
+    flags &= ~FS_APPEND_FL;
+    ::ioctl(fd.get(), FS_IOC_SETFLAGS, &flags);
+
+    const std::string restored = container("com.example.restored", 12, false);
+    ASSERT_FALSE(restored.empty());
+    EXPECT_EQ("restored", readFile(restored + "/Documents/restored.txt"));
+    for (const char* skeleton : {"Library/Caches", "Library/Preferences", "tmp"})
+        EXPECT_TRUE(fs::is_directory(restored + "/" + skeleton)) << skeleton;
+    const std::string group = container("systemgroup.com.example.restored", 13, false);
+    EXPECT_EQ("shared", readFile(group + "/Shared.txt"));
+    EXPECT_TRUE(fs::is_directory(group + "/Library/Caches"));
+
+    EXPECT_TRUE(fs::is_directory(blocked + "/Occupied"));
+    EXPECT_FALSE(fs::exists(blocked + "/Occupied/new"));
+    EXPECT_EQ("new", readFile(daemon.at(backup + "/Data.inprogress.failed/com.example.blocked/Occupied/new")));
+    EXPECT_FALSE(fs::exists(daemon.at(backup + "/Data"))) << "renamed to inprogress";
+}
+
+TEST_F(Boot, NewBuildRollsSystemContainerNamesAndMigrates) {
+    startAndSettle(true);
+    const std::string system = container("com.example.system", 12);
+    const std::string group = container("systemgroup.com.example.group", 13);
+    const std::string pinned = container("systemgroup.com.tarrow.wrenfield", 13);
+    const std::string wellKnown = container("com.tarrow.settingsd", 12);
+    ASSERT_FALSE(system.empty() || group.empty() || pinned.empty() || wellKnown.empty());
+    ASSERT_EQ(0, daemon.stop());
+    // A well-known container that an older build left under a UUID name.
+    const std::string misplaced = daemon.at(std::string(kSystemData) + "/0A1B2C3D-0000-4000-8000-0000000000BB");
+    fs::rename(wellKnown, misplaced);
+    writeRootFile(daemon, "private/var/mobile/Library/Logs/Vesselry/vesseld.log.0", "old zero");
+    writeRootFile(daemon, "private/var/mobile/Library/Logs/Vesselry/vesseld.log.3", "old three");
+    writeRootFile(daemon, "etc/os-release", "NAME=vessel\nBUILD_ID=next\n");
+    rebootAndSettle();
+
+    const std::string rolledSystem = container("com.example.system", 12, false);
+    const std::string rolledGroup = container("systemgroup.com.example.group", 13, false);
+    EXPECT_NE(system, rolledSystem);
+    EXPECT_NE(group, rolledGroup);
+    EXPECT_TRUE(fs::is_directory(rolledSystem + "/Library"));
+    EXPECT_FALSE(fs::exists(system));
+    EXPECT_EQ(pinned, container("systemgroup.com.tarrow.wrenfield", 13, false));
+    EXPECT_EQ(wellKnown, container("com.tarrow.settingsd", 12, false));
+    EXPECT_TRUE(fs::is_directory(wellKnown));
+    EXPECT_FALSE(fs::exists(misplaced));
+    // One rotated file is kept on this build: ".0" becomes ".1"; the rest goes with the
+    // old directory.
+    EXPECT_EQ("old zero", readFile(daemon.at(std::string(kLog) + ".1")));
+    EXPECT_FALSE(fs::exists(daemon.at("private/var/mobile/Library/Logs/Vesselry")));
+    EXPECT_NE(std::string::npos, log().find("Saved last build version of next"));
+    EXPECT_NE(std::string::npos, readFile(daemon.at("private/var/root/Library/Vesselry/vsl_migration_status.plist"))
+                                     .find("next"));
+
+    rebootAndSettle();
+    EXPECT_NE(std::string::npos, log().find("skipping upgrade"));
+    EXPECT_EQ(rolledSystem, container("com.example.system", 12, false));
+}
+
+TEST_F(Boot, AMultiUserDeviceKeepsItsOldLogDirectory) {
+    writeRootFile(daemon, "etc/vesseld/device.plist", deviceFacts("<key>MultiUser</key><true/>"));
+    writeRootFile(daemon, "private/var/mobile/Library/Logs/Vesselry/vesseld.log.0", "old zero");
+    startAndSettle(true);
+    EXPECT_NE(std::string::npos, log().find("Did not find last build info"));
+    EXPECT_EQ("old zero", readFile(daemon.at("private/var/mobile/Library/Logs/Vesselry/vesseld.log.0")));
+    EXPECT_FALSE(fs::exists(daemon.at(std::string(kLog) + ".1")));
+}
+
+// The marker is made only by the first-boot clean-up's completion: a start that stops
+// before it (here, on the fatal upcall condition) leaves first-boot work to the next.
+TEST_F(Boot, AFatalStopBeforeTheCleanupsLeavesFirstBootWorkToTheNextStart) {
+    const std::string blocker = daemon.at("run/vesseld/com.tarrow.vesseld.upcall");
+    fs::create_directories(blocker + "/occupied");
+    std::string out, err;
+    int status = runProgram({vesseldPath(), "--root", daemon.root(), "--init"}, &out, &err);
+    EXPECT_NE(0, status) << err;
+    EXPECT_NE(std::string::npos, log().find("Failed to initialize kernel upcall interface.")) << log();
+    EXPECT_EQ(1u, occurrences(log(), "vesseld performing first boot initialization"));
+
+    fs::remove_all(blocker);
+    startAndSettle(true);
+    EXPECT_EQ(2u, occurrences(log(), "vesseld performing first boot initialization"));
+    ASSERT_EQ(0, daemon.stop());
+    startAndSettle(false);
+    EXPECT_EQ(2u, occurrences(log(), "vesseld performing first boot initialization"));
+}
+
+}  // namespace
