@@ -11,7 +11,9 @@
 #include <filesystem>
 #include <string>
 
-#include "Daemon/Core/VSLPropertyListFile.h"
+#include <sqlite3.h>
+
+#include "Daemon/CodeSigning/VSLSQLiteDB.h"
 #include "Platform/UniqueFd.h"
 #include "Platform/Value.h"
 #include "Support/Boot.h"
@@ -33,7 +35,8 @@ const char* const kSystemData = "private/var/containers/Data/System";
 const char* const kSystemGroup = "private/var/containers/Shared/SystemGroup";
 const char* const kUserData = "private/var/mobile/Containers/Data/Application";
 
-std::string deviceFacts(const std::string& entries) {
+// A property-list dictionary of these XML entries.
+std::string plistWith(const std::string& entries) {
     return "<?xml version=\"1.0\" encoding=\"UTF-8\"?>\n<plist version=\"1.0\"><dict>" + entries +
            "</dict></plist>\n";
 }
@@ -50,19 +53,19 @@ protected:
         admin = daemon.addClient("admin", "com.example.admin", dict({{kAllowed, Value::boolean(true)}}));
         ASSERT_FALSE(admin.empty());
     }
-    void startAndSettle(bool firstBoot) {
-        ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
+    void startAndSettle(bool firstBoot, const std::vector<std::string>& environment = {}) {
+        ASSERT_TRUE(daemon.start(environment)) << readFile(daemon.at("vesseld.stderr"));
         ASSERT_TRUE(waitForNotification(daemon, kCleanupCompleteNotification));
         if (firstBoot) {
             ASSERT_TRUE(waitForNotification(daemon, kRebootCleanupCompleteNotification));
         }
     }
-    void rebootAndSettle() {
+    void rebootAndSettle(const std::vector<std::string>& environment = {}) {
         if (daemon.running()) {
             ASSERT_EQ(0, daemon.stop());
         }
         simulateReboot(daemon);
-        startAndSettle(true);
+        startAndSettle(true, environment);
     }
     // The container's path, made when missing.
     std::string container(const std::string& identifier, uint64_t containerClass, bool create = true) {
@@ -73,6 +76,23 @@ protected:
         return r.string("ReplyPath");
     }
     std::string log() { return readFile(daemon.at(kLog)); }
+    // Rows of the code-signing database marked as advance copies (daemon stopped: it
+    // holds the database exclusively).
+    int advanceCopies() {
+        std::string path = daemon.at(std::string("private/var/root/Library/Vesselry/") + kVSLCodeSigningDatabaseFileName);
+        sqlite3* db = nullptr;
+        int count = -1;
+        if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
+            sqlite3_stmt* statement = nullptr;
+            if (sqlite3_prepare_v2(db, "SELECT COUNT(*) FROM code_signing_info WHERE (placeholder & 2) > 0;", -1,
+                                   &statement, nullptr) == SQLITE_OK &&
+                sqlite3_step(statement) == SQLITE_ROW)
+                count = sqlite3_column_int(statement, 0);
+            sqlite3_finalize(statement);
+        }
+        sqlite3_close(db);
+        return count;
+    }
 
     DaemonProcess daemon;
     std::string admin;
@@ -85,7 +105,15 @@ TEST_F(Boot, FirstBootWorkRunsOncePerBootAndItsNotificationFollowsTheOrphanClean
     EXPECT_EQ(1u, occurrences(log(), "vesseld performing first boot initialization"));
     const std::string kept = container("com.example.kept", 2);
     ASSERT_FALSE(kept.empty());
+    // Code-signing data an installer registered ahead of the install lasts the boot.
+    writeRootFile(daemon, "info.plist", plistWith("<key>Entitlements</key><dict/>"));
+    writeRootFile(daemon, "options.plist", plistWith("<key>com.tarrow.Vesselry.AdvanceCopy</key><true/>"));
+    auto registered = daemon.run(admin, {"processCodeSigningInfo", "Identifier=com.example.advance",
+                                         "CodeSigningInfo:plist=@" + daemon.at("info.plist"),
+                                         "OptionsDictionary:plist=@" + daemon.at("options.plist")});
+    ASSERT_EQ(1u, registered.code()) << registered.err << registered.out;
     ASSERT_EQ(0, daemon.stop());
+    ASSERT_EQ(1, advanceCopies());
 
     // Left behind: entries without metadata in a per-user and a system class directory,
     // a transient container's directory.
@@ -98,13 +126,24 @@ TEST_F(Boot, FirstBootWorkRunsOncePerBootAndItsNotificationFollowsTheOrphanClean
 
     // A restart within the boot: no first-boot work, the orphans stay.
     startAndSettle(false);
+    ASSERT_EQ(0, daemon.stop());
+    EXPECT_EQ(1, advanceCopies()) << "a restart keeps advance copies";
     EXPECT_EQ(1u, occurrences(log(), "vesseld performing first boot initialization"));
     EXPECT_TRUE(fs::exists(daemon.at(std::string(kUserData) + "/" + kOrphan)));
     EXPECT_TRUE(fs::exists(daemon.at(std::string(kSystemData) + "/" + kOrphan)));
 
     // After a reboot: orphans and transient containers are gone by the time the
     // first-boot clean-up reports completion; the container with metadata stays.
-    rebootAndSettle();
+    const std::string trace = daemon.at("durable.trace");
+    rebootAndSettle({"VESSELD_DURABLE_TRACE=" + trace});
+    // The steps say the order: both orphans renamed into death row before the post.
+    const std::string steps = readFile(trace);
+    const size_t posted = steps.find("notify/" + std::string(kRebootCleanupCompleteNotification));
+    ASSERT_NE(std::string::npos, posted) << steps;
+    for (const char* classDirectory : {kUserData, kSystemData}) {
+        size_t moved = steps.find("rename " + fs::canonical(daemon.at(classDirectory)).string() + "/" + kOrphan);
+        EXPECT_LT(moved, posted) << classDirectory << "\n" << steps;
+    }
     EXPECT_EQ(2u, occurrences(log(), "vesseld performing first boot initialization"));
     EXPECT_FALSE(fs::exists(daemon.at(std::string(kUserData) + "/" + kOrphan)));
     EXPECT_FALSE(fs::exists(daemon.at(std::string(kSystemData) + "/" + kOrphan)));
@@ -112,11 +151,13 @@ TEST_F(Boot, FirstBootWorkRunsOncePerBootAndItsNotificationFollowsTheOrphanClean
     EXPECT_NE(std::string::npos, log().find("Deleting orphaned data missing a metadata file at"));
     EXPECT_TRUE(fs::exists(kept + "/.com.tarrow.vesselry.metadata.plist"));
     EXPECT_EQ(kept, container("com.example.kept", 2, false));
+    ASSERT_EQ(0, daemon.stop());
+    EXPECT_EQ(0, advanceCopies()) << "a reboot drops advance copies";
 }
 
 TEST_F(Boot, RestoredSystemContainersAreInstalledAndWhatCannotBePlacedIsKept) {
     // An internal build keeps the backup directory, and so what could not be placed.
-    writeRootFile(daemon, "etc/vesseld/device.plist", deviceFacts("<key>InternalBuild</key><true/>"));
+    writeRootFile(daemon, "etc/vesseld/device.plist", plistWith("<key>InternalBuild</key><true/>"));
     startAndSettle(true);
     const std::string blocked = container("com.example.blocked", 12);
     ASSERT_FALSE(blocked.empty());
@@ -195,7 +236,7 @@ TEST_F(Boot, NewBuildRollsSystemContainerNamesAndMigrates) {
 }
 
 TEST_F(Boot, AMultiUserDeviceKeepsItsOldLogDirectory) {
-    writeRootFile(daemon, "etc/vesseld/device.plist", deviceFacts("<key>MultiUser</key><true/>"));
+    writeRootFile(daemon, "etc/vesseld/device.plist", plistWith("<key>MultiUser</key><true/>"));
     writeRootFile(daemon, "private/var/mobile/Library/Logs/Vesselry/vesseld.log.0", "old zero");
     startAndSettle(true);
     EXPECT_NE(std::string::npos, log().find("Did not find last build info"));

@@ -12,6 +12,7 @@
 #include "Support/DaemonProcess.h"
 #include "Support/RootFiles.h"
 #include "Support/TempRoot.h"
+#include "Platform/Value.h"
 
 using namespace vsl::test;
 using vsl::client::kCleanupCompleteNotification;
@@ -65,4 +66,31 @@ TEST(StartupCleanup, StagingLeftoversGoThroughDeathRowBeforeCleanupComplete) {
         std::string line = steps.substr(at, steps.find('\n', at) - at);
         EXPECT_NE(std::string::npos, line.find("/Dead/temp.")) << line;
     }
+}
+
+// Destroying a big death row is background work: clients are answered meanwhile.
+TEST(StartupCleanup, ClientsAreServedWhileABigDeathRowIsDestroyed) {
+    DaemonProcess daemon;
+    std::string admin = daemon.addClient("admin", "com.example.admin",
+                                         vsl::dict({{"com.tarrow.private.Vesselry.allowed", vsl::Value::boolean(true)}}));
+    ASSERT_FALSE(admin.empty());
+    ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
+    ASSERT_TRUE(waitForNotification(daemon, kCleanupCompleteNotification));
+    ASSERT_EQ(0, daemon.stop());
+
+    const std::string tree = daemon.at(std::string(kDeathRow) + "/temp.big/tree");
+    for (int d = 0; d < 50; d++) {
+        std::string dir = tree + "/" + std::to_string(d);
+        fs::create_directories(dir);
+        for (int f = 0; f < 1000; f++) std::ofstream(dir + "/" + std::to_string(f)) << 'x';
+    }
+
+    ASSERT_TRUE(daemon.start()) << readFile(daemon.at("vesseld.stderr"));
+    for (int i = 0; i < 3; i++) {
+        auto r = daemon.run(admin, {"--timeout", "60", "createOrLookup", "Identifier=com.example.served" + std::to_string(i),
+                                    "ContainerClass=2", "CreateIfNecessary=true"});
+        EXPECT_EQ(1u, r.code()) << r.err;
+    }
+    ASSERT_TRUE(waitForNotification(daemon, kCleanupCompleteNotification, std::chrono::seconds(600)));
+    EXPECT_EQ(std::vector<std::string>{}, entriesOf(daemon.at(kDeathRow)));
 }
