@@ -168,6 +168,12 @@ TEST_F(Boot, RestoredSystemContainersAreInstalledAndWhatCannotBePlacedIsKept) {
     writeRootFile(daemon, backup + "/Data/com.example.restored/Documents/restored.txt", "restored");
     writeRootFile(daemon, backup + "/Data/com.example.blocked/Occupied/new", "new");
     writeRootFile(daemon, backup + "/Shared/systemgroup.com.example.restored/Shared.txt", "shared");
+    // A link in the user's backup must not make the daemon install another directory.
+    writeRootFile(daemon, "outside/secret", "secret");
+    fs::create_directory_symlink(daemon.at("outside"), daemon.at(backup + "/Data/com.example.linked"));
+    // The backup is the user's, as on a device (running unprivileged it is ours anyway).
+    for (const char* mine : {"", "/Data", "/Shared"})
+        (void)::lchown(daemon.at(backup + mine).c_str(), 501, 501);
     // The blocked container's entries cannot be removed, so its restored child cannot
     // take their place.
     UniqueFd fd(::open(blocked.c_str(), O_RDONLY | O_DIRECTORY));
@@ -194,6 +200,10 @@ TEST_F(Boot, RestoredSystemContainersAreInstalledAndWhatCannotBePlacedIsKept) {
     EXPECT_FALSE(fs::exists(blocked + "/Occupied/new"));
     EXPECT_EQ("new", readFile(daemon.at(backup + "/Data.inprogress.failed/com.example.blocked/Occupied/new")));
     EXPECT_FALSE(fs::exists(daemon.at(backup + "/Data"))) << "renamed to inprogress";
+    EXPECT_EQ("secret", readFile(daemon.at("outside/secret")));
+    auto linked = daemon.run(admin, {"createOrLookup", "Identifier=com.example.linked", "ContainerClass=12",
+                                     "CreateIfNecessary=false"});
+    EXPECT_EQ(21u, linked.code()) << "nothing installed through the link";
 }
 
 TEST_F(Boot, NewBuildRollsSystemContainerNamesAndMigrates) {

@@ -1,6 +1,7 @@
 // The migration run at the first boot of a new build, before any client is served.
 #include <cerrno>
 #include <cstdlib>
+#include <cstring>
 #include <string>
 
 #include "Daemon/CodeSigning/VSLWhitelist.h"
@@ -16,8 +17,10 @@
 #include "Daemon/Storage/VSLMetadata.h"
 #include "Daemon/Storage/VSLPerUserConfiguration.h"
 #include "Platform/DeviceFacts.h"
+#include "Platform/DurableIO.h"
 #include "Platform/Log.h"
 #include "Platform/SystemRoot.h"
+#include "Platform/UniqueFd.h"
 
 namespace vsl {
 
@@ -49,7 +52,13 @@ void moveOldLogFiles() {
     // then nothing moves and nothing is removed.
     if (*oldPath == logDirectory) return;
     VSLErrorRef error;
-    if (auto items = fm.urlsForItemsInDirectoryAtURL(*oldPath, &error)) {
+    // Below the mobile user's home: a link on the way must not make the daemon move
+    // files out of some other directory.
+    UniqueFd checked;
+    if (int rc = durable::openDirectoryNoFollow(*oldPath, checked.out()); rc && rc != ENOENT) {
+        LogWrite(kLogLevelError, kBuildUpgradeFn, "Failed to get items for deletion: %@ : %s", *oldPath,
+                 std::strerror(rc));
+    } else if (auto items = fm.urlsForItemsInDirectoryAtURL(*oldPath, &error)) {
         for (const auto& item : *items) {
             std::string name = lastPathComponent(item.path);
             auto n = numericExtension(name);

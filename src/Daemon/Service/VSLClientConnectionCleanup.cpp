@@ -164,6 +164,9 @@ void VSLClientConnection::vesselCleanupWithCompletion(std::function<void()> comp
     std::vector<std::string> items;
     appendItemsOf(config->stagingDirectory(), "Failed to get items at global staging URL: %@ : %@", listed, items);
     userIdentityCache()->forEachAccessibleUserIdentitySynchronouslyExecuteBlock([&](const VSLUserIdentityRef& user) {
+        // A user without a home has no staging, and none is made for it here.
+        auto perUser = config->getPerUserConfigurationForUserIdentity(user);
+        if (!perUser || !perUser->existsUserBaseDirectory()) return;
         appendItemsOf(config->stagingDirectoryURLForUserIdentity(user, kVSLClassApplicationData),
                       "Failed to get items at per-user staging URL: %@ : %@", listed, items);
     });

@@ -9,8 +9,10 @@
 #include "Daemon/Storage/VSLGlobalConfiguration.h"
 #include "Daemon/Storage/VSLMetadata.h"
 #include "Daemon/Storage/VSLPerUserConfiguration.h"
+#include "Platform/DurableIO.h"
 #include "Platform/Log.h"
 #include "Platform/SystemRoot.h"
+#include "Platform/UniqueFd.h"
 
 namespace vsl {
 
@@ -18,6 +20,13 @@ namespace {
 
 constexpr const char* kMoveIntoPlace = "VSLMoveSystemContainersIntoPlace";
 constexpr const char* kMoveOne = "_moveSystemContainerIntoPlace";
+
+// The backup lives in the mobile user's home: a link put on the way must not lead the
+// daemon to install (or list) some other directory.
+bool isPlainDirectory(const std::string& path) {
+    UniqueFd fd;
+    return durable::openDirectoryNoFollow(path, fd.out()) == 0;
+}
 
 std::string withExtension(const std::string& path, const char* extension) {
     return path + "." + extension;
@@ -49,6 +58,10 @@ void installBackup(const BackupKind& kind, const VSLClientConnectionRef& connect
     if (!kind.directory || !fm.itemExistsAtURL(*kind.directory)) return;
     std::string inProgress = withExtension(*kind.directory, "inprogress");
     VSLErrorRef error;
+    if (!isPlainDirectory(*kind.directory)) {
+        LogWrite(kLogLevelError, kMoveIntoPlace, kind.listFailure, *kind.directory, "not a directory reached without links");
+        return;
+    }
     if (!fm.removeItemAtURL(inProgress, &error))
         LogWrite(kLogLevelError, kMoveIntoPlace, "Failed to remove existing inprogress system containers: %@", error);
     if (!fm.moveItemAtURL(*kind.directory, inProgress, &error)) {
@@ -71,6 +84,11 @@ void _moveSystemContainerIntoPlace(const std::string& item, VSLContainerClass co
     auto& fm = VSLFileManager::defaultManager();
     const std::string identifier = lastPathComponent(item);
     const std::string failureDirectory = joinPath(withExtension(parentPath(item), "failed"), identifier);
+    if (!isPlainDirectory(item)) {
+        LogWrite(kLogLevelError, kMoveOne, "Failed to enumerate contents of restored system container %@ at %@: %@",
+                 identifier, item, "not a directory reached without links");
+        return;
+    }
     uint64_t code = kVSLSuccess;
     auto identity = VSLContainerIdentity::containerIdentityWithIdentifier(identifier, containerClass, &code);
     if (!identity) {
