@@ -99,6 +99,11 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
         LogWrite(kLogLevelError, kInit, "Can't create dispatch queues.");
         std::abort();
     }
+    // The lock-state queue starts in the device's state, so protection changes that the
+    // every-start setup restarts on a locked device park on it until the unlock rather
+    // than spin on a queue nobody has suspended yet. Registration comes later, in its
+    // place; the callback keeps suspensions balanced, so acting twice is harmless.
+    lock_state_notification_callback();
     auto connection = VSLClientConnection::sharedClientConnection();
     prepareForClients();
 
