@@ -104,6 +104,7 @@ TEST(VesselctlJson, EverySubcommandPrintsItsDocumentedKeys) {
         row({"upcall", "uid=" + std::to_string(mobile->uid)}),
         row({"status"}, 0, {}),
         row({"doctor"}),
+        row({"wait", "com.tarrow.vesseld.cleanup-complete"}),
         row({"personaUniqueStrings"}, 0, {"ReplyError", "ReplyPersonaUniqueStringsArray"}),
         row({"delete", "com.example.app"}),
         // Failures: the error object, and the exit status says which kind.
@@ -111,6 +112,7 @@ TEST(VesselctlJson, EverySubcommandPrintsItsDocumentedKeys) {
         row({"info", "get", "com.example.missing", "color"}, 1, kErrorKeys),
         row({"create", "com.example.app", "--class", "teapot"}, 2, kErrorKeys),
         row({"frobnicate"}, 2, kErrorKeys),
+        row({"wait", "com.tarrow.vesseld.never-posted", "--timeout", "0"}, 1, kErrorKeys),
         row({"--socket", daemon.at("nothing-here"), "create", "com.example.app"}, 3, kErrorKeys),
     };
 

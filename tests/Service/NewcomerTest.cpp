@@ -7,9 +7,12 @@
 #include <unistd.h>
 
 #include <chrono>
+#include <filesystem>
 #include <fstream>
 #include <thread>
 
+#include "Daemon/Service/VSLStartup.h"
+#include "Platform/NamedSemaphore.h"
 #include "Support/DaemonProcess.h"
 #include "Support/TempRoot.h"
 
@@ -80,7 +83,13 @@ int runCtl(const std::vector<std::string>& prefix, const std::string& root, cons
 // Declared before the daemon, so the daemon stops before its root goes.
 struct RemovedOnExit {
     std::string path;
-    ~RemovedOnExit() { removeTree(path); }
+    ~RemovedOnExit() {
+        // The first-boot marker of a daemon on a root below it goes too.
+        std::error_code ec;
+        for (const auto& entry : std::filesystem::directory_iterator(path, ec))
+            vsl::removeSemaphore(vsl::semaphoreNameForSystemRoot(vsl::kFirstBootSemaphoreBase, entry.path()));
+        removeTree(path);
+    }
 };
 
 std::string lineValue(const std::string& out, const std::string& key) {

@@ -17,6 +17,8 @@
 
 #include "Client/VSLConnection.h"
 #include "Daemon/Core/VSLPropertyListFile.h"
+#include "Platform/NamedSemaphore.h"
+#include "Support/Boot.h"
 #include "Platform/PropertyList.h"
 #include "Platform/SystemRoot.h"
 #include "Support/TempRoot.h"
@@ -97,6 +99,7 @@ DaemonProcess::DaemonProcess() : root_(makeTempDir("vessel-e2e-")) {}
 
 DaemonProcess::~DaemonProcess() {
     if (running()) kill();
+    removeSemaphore(firstBootMarkerName(*this));
     removeTree(root_);
 }
 

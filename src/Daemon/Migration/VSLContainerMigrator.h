@@ -28,6 +28,14 @@ public:
     // retired containers.
     bool performPerUserDataMigrationForClientConnection(const VSLClientConnectionRef& connection, VSLErrorRef* error);
 
+    // The first boot of a new build (VSLContainerMigratorBuildUpgrade.cpp): old log
+    // files join the current rotation (not on a multi-user device), bundles move from
+    // the legacy location, a device without system containers records the ACL
+    // migration as done, and well-known system containers move to their fixed names.
+    bool performSynchronousBuildUpgradeMigration(VSLMigrationStatus& status, VSLErrorRef* error);
+    void _checkIfDeviceMayNeedSystemContainerACLMigration(VSLMigrationStatus& status);
+    bool _performWhitelistMigrationWithError(VSLErrorRef* error);
+
     // Class 2: the application's bundle container; class 4: its parent's.
     VSLMetadataRef _bundleContainerForDataContainer(const VSLMetadata& container, VSLErrorRef* error);
     void _setDataProtectionIfNecessaryOnContainer(const VSLMetadata& container);

@@ -136,6 +136,26 @@ public:
     void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
     // True when the item is on death row or no longer exists.
     bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread, VSLErrorRef* error);
+    // Start-up clean-ups (VSLClientConnectionCleanup.cpp). Both return at once; the work
+    // and the completion run on the background queue. Every start: staging items of the
+    // last process go to death row, then death row is destroyed.
+    void vesselCleanupWithCompletion(std::function<void()> completion);
+    // First start after boot: transient directories to death row; class-directory
+    // entries without metadata (orphans) to death row, class by class on the
+    // background queue; advance copies dropped; then the completion.
+    void rebootVesselCleanupWithCompletion(std::function<void()> completion);
+    void _cleanupOrphanedDataForDirectories(const std::vector<std::string>& directories,
+                                            VSLContainerClass containerClass);
+    void _cleanupOprhanedCodeSigningMappingData();
+
+    // Start-up setup (VSLClientConnectionSetup.cpp), on the listener queue. First start
+    // after boot: on a new build the system containers' directory names are rolled and
+    // the build-upgrade migration runs; restored system containers are installed; a
+    // multi-user device reconciles its groups. Every start: replacements a crash
+    // interrupted are settled, pending protection-class changes restarted.
+    void rebootVesselSetup();
+    void vesselSetup();
+    void _regenerateAllSystemContainerPaths();
     // True when the item is gone from its place (removed, or moved to /tmp).
     bool _removeItemOrMoveToTempAtURL(const std::string& url, VSLErrorRef* error);
 

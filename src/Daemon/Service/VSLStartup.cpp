@@ -6,10 +6,12 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <cstring>
+#include <memory>
 #include <string>
 
+#include "Client/VSLNotification.h"
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
-#include "Daemon/Concurrency/VSLDataProtectionManager.h"
 #include "Daemon/Service/VSLClientConnection.h"
 #include "Daemon/Service/VSLCommandTable.h"
 #include "Daemon/Service/VSLLockState.h"
@@ -18,72 +20,126 @@
 #include "Platform/CrashAnnotation.h"
 #include "Platform/DeviceFacts.h"
 #include "Platform/Log.h"
+#include "Platform/NamedSemaphore.h"
+#include "Platform/Notification.h"
 #include "Platform/SandboxState.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {
+
+namespace {
+
+constexpr const char* kInit = "vesseld_init";
+
+// The first-boot clean-up's interval lives until its completion runs.
+std::shared_ptr<SignpostInterval>& firstBootCleanupInterval() {
+    static std::shared_ptr<SignpostInterval> interval;
+    return interval;
+}
+
+void openRotatingLog() {
+    const bool internal = deviceFacts().internalBuild;
+    LogFileOptions options;
+    options.directory = VSLGlobalConfiguration::sharedInstance()->logDirectory();
+    options.maxBytes = internal ? 262144 : 102400;
+    options.rotatedFiles = diskLoggingParameter();
+    if (!openLogFile(options)) {
+        std::string path = joinPath(options.directory, options.name);
+        syslog(LOG_ERR, "Failed to set up rotating logs at path %s", path.c_str());
+    }
+    setCrashAnnotationFile(joinPath(options.directory, "vesseld.crash"));
+    LogWrite(kLogLevelDebug, kInit, "vesseld built at %s %s started", __DATE__, __TIME__);
+}
+
+// Work that belongs to no step of its own but must precede every client.
+void prepareForClients() {
+    // A notification of the last process must not be taken for one of this process.
+    if (int rc = withdrawNotification(client::kCleanupCompleteNotification))
+        LogWrite(kLogLevelError, kInit, "Failed to withdraw cleanup-complete: %d", rc);
+    if (validateCommandTable() != 0)
+        LogWrite(kLogLevelError, kInit, "The command table is inconsistent; affected commands answer 49");
+    // Opens the code-signing database now, so an unusable file stops the daemon at
+    // start rather than at the first request.
+    VSLCodeSigningMapping::sharedInstance();
+    // Before any table is written: a kill during a rewrite leaves its temporary file.
+    if (int rc = SandboxState::removeTemporaryFiles())
+        LogWrite(kLogLevelError, kInit, "Failed to remove temporary sandbox files: %d", rc);
+}
+
+}  // namespace
 
 const std::shared_ptr<WorkQueue>& lockStateQueue() {
     static const auto queue = WorkQueue::serial("com.tarrow.vesseld.lockstate");
     return queue;
 }
 
+int diskLoggingParameter() { return deviceFacts().internalBuild ? 4 : 1; }
+
+std::string firstBootSemaphoreName() { return semaphoreNameForSystemRoot(kFirstBootSemaphoreBase, systemRoot()); }
+
+void set_first_boot_work_completed() {
+    LogWrite(kLogLevelNotice, "set_first_boot_work_completed", "vesseld first boot cleanup complete");
+    const std::string name = firstBootSemaphoreName();
+    if (int rc = createSemaphore(name, 0444, 0))
+        LogWrite(kLogLevelError, "set_first_boot_work_completed", "Failed to create semaphore %s: %s", name,
+                 std::strerror(rc));
+    if (int rc = postNotification(client::kRebootCleanupCompleteNotification))
+        LogWrite(kLogLevelError, "set_first_boot_work_completed", "Failed to post reboot-cleanup-complete: %u", rc);
+    if (auto& interval = firstBootCleanupInterval()) {
+        interval->end("");
+        interval.reset();
+    }
+}
+
 void vesseld_init(std::shared_ptr<Transaction> transaction) {
     SignpostInterval interval(LogCategory::Ipc, "StartingUp", "");
-    bool internal = deviceFacts().internalBuild;
-
-    LogFileOptions options;
-    options.directory = VSLGlobalConfiguration::sharedInstance()->logDirectory();
-    options.maxBytes = internal ? 262144 : 102400;
-    options.rotatedFiles = internal ? 4 : 1;
-    if (!openLogFile(options)) {
-        std::string path = joinPath(options.directory, options.name);
-        syslog(LOG_ERR, "Failed to set up rotating logs at path %s", path.c_str());
-    }
-    setCrashAnnotationFile(joinPath(options.directory, "vesseld.crash"));
-    LogWrite(kLogLevelDebug, "vesseld_init", "vesseld built at %s %s started", __DATE__, __TIME__);
+    openRotatingLog();
 
     if (!deathRowQueue() || !lockStateQueue()) {
-        LogWrite(kLogLevelError, "vesseld_init", "Can't create dispatch queues.");
+        LogWrite(kLogLevelError, kInit, "Can't create dispatch queues.");
         std::abort();
     }
-    if (validateCommandTable() != 0)
-        LogWrite(kLogLevelError, "vesseld_init", "The command table is inconsistent; affected commands answer 49");
-    // Opens the code-signing database now, so an unusable file stops the daemon at
-    // start rather than at the first request; advance copies never outlive a restart.
-    if (auto mapping = VSLCodeSigningMapping::sharedInstance()) {
-        VSLErrorRef error;
-        if (!mapping->removeAllAdvanceCopiesWithError(&error))
-            LogWrite(kLogLevelError, "vesseld_init", "Failed to remove advance copies: %@", error);
+    // The lock-state queue starts in the device's state, so protection changes that the
+    // every-start setup restarts on a locked device park on it until the unlock rather
+    // than spin on a queue nobody has suspended yet. Registration comes later, in its
+    // place; the callback keeps suspensions balanced, so acting twice is harmless.
+    lock_state_notification_callback();
+    auto connection = VSLClientConnection::sharedClientConnection();
+    prepareForClients();
+
+    // The marker is made only once the first-boot clean-up has completed, so a crash
+    // during first-boot work repeats it at the next start.
+    const bool firstBoot = !semaphoreExists(firstBootSemaphoreName());
+    if (firstBoot) {
+        LogWrite(kLogLevelNotice, kInit, "vesseld performing first boot initialization");
+        SignpostInterval setup(LogCategory::Startup, "FirstBootSetup", "");
+        connection->rebootVesselSetup();
+    }
+    {
+        SignpostInterval setup(LogCategory::Startup, "BootSetup", "");
+        connection->vesselSetup();
     }
 
-    // Before any table is written: a kill during a rewrite leaves its temporary file.
-    if (int rc = SandboxState::removeTemporaryFiles())
-        LogWrite(kLogLevelError, "vesseld_init", "Failed to remove temporary sandbox files: %d", rc);
-
-    // Every start: replacements a crash interrupted are settled before anything looks
-    // at containers; their journals go to death row.
-    VSLErrorRef replaceError;
-    if (!VSLClientConnection::sharedClientConnection()->_recoverFromReplaceOperationsWithError(&replaceError))
-        LogWrite(kLogLevelError, "vesseld_init", "Failed to recover replace operations: %@", replaceError);
-
-    // Lock state first, so a change restarted below while the device is locked parks
-    // on a suspended queue.
-    registerForLockStateNotifications();
-    VSLErrorRef protectionError;
-    if (!VSLDataProtectionManager::defaultManager().restartPendingDataProtectionOperationsWithError(&protectionError))
-        LogWrite(kLogLevelError, "vesseld_init", "Failed restarting pending data protection operations: %@",
-                 protectionError);
     std::string upcallError;
     if (!startKernelUpcallServer(&upcallError)) {
-        LogWrite(kLogLevelError, "vesseld_init", "Failed to initialize kernel upcall interface.");
+        LogWrite(kLogLevelError, kInit, "Failed to initialize kernel upcall interface.");
         std::fprintf(stderr, "vesseld: Failed to initialize kernel upcall interface: %s\n", upcallError.c_str());
         closeLogFile();
         ::_exit(1);
     }
 
-    // Every start: whatever a crash left on death row is destroyed in the background.
-    VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);
+    registerForLockStateNotifications();
+
+    if (firstBoot) {
+        firstBootCleanupInterval() = std::make_shared<SignpostInterval>(LogCategory::Startup, "FirstBootCleanup", "");
+        connection->rebootVesselCleanupWithCompletion(set_first_boot_work_completed);
+    }
+    auto bootCleanup = std::make_shared<SignpostInterval>(LogCategory::Startup, "BootCleanup", "");
+    connection->vesselCleanupWithCompletion([bootCleanup] {
+        if (int rc = postNotification(client::kCleanupCompleteNotification))
+            LogWrite(kLogLevelError, kInit, "Failed to post cleanup-complete: %u", rc);
+        bootCleanup->end("");
+    });
 
     interval.end("");
     transaction->close();

@@ -1,5 +1,7 @@
 #include "SubcommandTable.h"
 
+#include "Wait.h"
+
 namespace {
 
 constexpr Subcommand kSubcommands[] = {
@@ -16,6 +18,7 @@ constexpr Subcommand kSubcommands[] = {
     {"wipe", "ID", "gives a plug-in data container a fresh skeleton", runWipe},
     {"status", "", "the daemon and its root at a glance", runStatus},
     {"doctor", "", "checks the root as an operator would; changes nothing", runDoctor},
+    {"wait", "NAME [--timeout S]", "waits until vesseld posts a notification", runWait},
     {"metadata", "[KEY=VALUE...]", "a container's metadata with its info dictionary", runRequestSubcommand},
     {"recreate-structure", "[KEY=VALUE...]", "lays down a container's skeleton again", runRequestSubcommand},
     {"regenerate-uuid", "[KEY=VALUE...]", "gives a container a new UUID", runRequestSubcommand},
