@@ -10,6 +10,9 @@ namespace vsl {
 
 // `base` for the root "/", else `base` + "-" + the first 16 hex digits of the SHA-256
 // of the root's real path, so daemons on different roots do not share a marker.
+// The marker of first-boot work done, one per system root (semaphoreNameForSystemRoot).
+inline constexpr const char* kFirstBootSemaphoreBase = "vesseld.fb_check";
+
 std::string semaphoreNameForSystemRoot(const std::string& base, const std::string& root);
 
 // Whether the semaphore exists (opened without creating, then closed).

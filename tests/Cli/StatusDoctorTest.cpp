@@ -12,6 +12,7 @@
 #include <map>
 
 #include "Platform/UniqueFd.h"
+#include "Support/Boot.h"
 #include "Support/DaemonProcess.h"
 #include "Support/Json.h"
 #include "Support/RootFiles.h"
@@ -92,6 +93,9 @@ TEST(VesselctlStatus, HealthyRootWithTheDaemonRunningThenStopped) {
     EXPECT_EQ(1, number(*perClass, "systemData"));
     EXPECT_EQ(0, number(*perClass, "appGroup"));
     EXPECT_EQ(13u, perClass->dictionaryValue()->size());
+    // The daemon's own first-boot marker, once its first-boot clean-up has run.
+    ASSERT_TRUE(waitForNotification(daemon, "com.tarrow.vesseld.reboot-cleanup-complete", std::chrono::seconds(60)));
+    EXPECT_EQ(true, ctlJson(daemon, {"status"}).json.find("FirstBootDone")->boolValue());
 
     ASSERT_EQ(0, ctlJson(daemon, {"keybag", "lock"}).exitCode);
     EXPECT_EQ("locked", *ctlJson(daemon, {"status"}).json.find("LockState")->stringValue());

@@ -4,6 +4,7 @@
 #include <memory>
 #include <string>
 
+#include "Platform/NamedSemaphore.h"
 #include "Platform/Transaction.h"
 #include "Platform/WorkQueue.h"
 
@@ -17,7 +18,6 @@ void vesseld_init(std::shared_ptr<Transaction> transaction);
 
 // The marker of a boot whose first-boot clean-up has completed: a named semaphore
 // unique to the system root. Removing it makes the next start a first boot.
-inline constexpr const char* kFirstBootSemaphoreBase = "vesseld.fb_check";
 std::string firstBootSemaphoreName();
 // The first-boot clean-up's completion: makes the marker, posts reboot-cleanup-complete.
 void set_first_boot_work_completed();

@@ -1,8 +1,6 @@
 #include "RootProbe.h"
 
 #include <fcntl.h>
-#include <openssl/evp.h>
-#include <semaphore.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
@@ -16,6 +14,7 @@
 #include <unistd.h>
 
 #include "Platform/DirectoryEntries.h"
+#include "Platform/NamedSemaphore.h"
 #include "Platform/PropertyList.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
@@ -111,18 +110,6 @@ std::optional<Value> readPropertyListFile(const std::string& path, std::string* 
 }
 
 bool firstBootWorkDone() {
-    std::string name = "/vesseld.fb_check";
-    if (!systemRootIsSlash()) {
-        unsigned char digest[EVP_MAX_MD_SIZE];
-        unsigned int length = 0;
-        const std::string& root = systemRoot();
-        EVP_Digest(root.data(), root.size(), digest, &length, EVP_sha256(), nullptr);
-        char hex[17];
-        for (int i = 0; i < 8; i++) std::snprintf(hex + 2 * i, 3, "%02x", digest[i]);
-        name += std::string("-") + hex;
-    }
-    sem_t* marker = ::sem_open(name.c_str(), 0);
-    if (marker == SEM_FAILED) return false;
-    ::sem_close(marker);
-    return true;
+    // The daemon's own naming, so a root's marker is found whatever path names the root.
+    return semaphoreExists(semaphoreNameForSystemRoot(kFirstBootSemaphoreBase, systemRoot()));
 }
