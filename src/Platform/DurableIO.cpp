@@ -23,11 +23,15 @@ namespace vsl::durable {
 namespace {
 #ifdef VESSEL_KILLPOINTS
 std::atomic<uint64_t> gSteps{0};
+// Steps numbered since the selected scope began; 0 while it has not.
+std::atomic<uint64_t> gNumbered{0};
+std::atomic<bool> gScopeBegun{false};
 
 struct KillConfig {
     uint64_t killAt = 0;
     std::string traceFile;
     std::string dropFsync;  // "item" or "parent": a fault the rename audit must catch
+    Scope scope = Scope::ClientMessages;
 };
 const KillConfig& killConfig() {
     static const KillConfig c = [] {
@@ -35,6 +39,8 @@ const KillConfig& killConfig() {
         if (const char* s = std::getenv("VESSELD_KILL_AT")) k.killAt = std::strtoull(s, nullptr, 10);
         if (const char* s = std::getenv("VESSELD_DURABLE_TRACE")) k.traceFile = s;
         if (const char* s = std::getenv("VESSELD_TEST_DROP_FSYNC")) k.dropFsync = s;
+        if (const char* s = std::getenv("VESSELD_KILL_SCOPE"); s && std::string(s) == "startup")
+            k.scope = Scope::Startup;
         return k;
     }();
     return c;
@@ -93,8 +99,14 @@ int copyByReadWrite(int from, int to) {
 std::string descriptorPath(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
 #ifdef VESSEL_KILLPOINTS
+void beginScope(Scope scope) {
+    if (scope == killConfig().scope) gScopeBegun.store(true);
+}
+
 void step(const char* kind, const std::string& path) {
-    uint64_t n = ++gSteps;
+    ++gSteps;
+    if (!gScopeBegun.load()) return;
+    uint64_t n = ++gNumbered;
     const KillConfig& k = killConfig();
     if (!k.traceFile.empty()) {
         static std::mutex traceMutex;

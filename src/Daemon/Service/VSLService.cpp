@@ -1,6 +1,7 @@
 #include "Daemon/Service/VSLService.h"
 
 #include "Daemon/Service/VSLProcessIPCEvent.h"
+#include "Platform/DurableIO.h"
 
 #ifdef VESSEL_KILLPOINTS
 #include <cstdlib>
@@ -50,6 +51,7 @@ std::unique_ptr<VSLService> VSLService::start(const std::shared_ptr<WorkQueue>& 
 #ifdef VESSEL_KILLPOINTS
         delayForTests(message.body);
 #endif
+        durable::beginScope(durable::Scope::ClientMessages);
         VSLPeerCredentials credentials;
         credentials.pid = peer->pid();
         credentials.uid = peer->uid();

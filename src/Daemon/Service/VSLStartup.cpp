@@ -17,6 +17,7 @@
 #include "Daemon/Upcall/VSLUpcallServer.h"
 #include "Platform/CrashAnnotation.h"
 #include "Platform/DeviceFacts.h"
+#include "Platform/DurableIO.h"
 #include "Platform/Log.h"
 #include "Platform/SandboxState.h"
 #include "Platform/SystemRoot.h"
@@ -29,6 +30,7 @@ const std::shared_ptr<WorkQueue>& lockStateQueue() {
 }
 
 void vesseld_init(std::shared_ptr<Transaction> transaction) {
+    durable::beginScope(durable::Scope::Startup);
     SignpostInterval interval(LogCategory::Ipc, "StartingUp", "");
     bool internal = deviceFacts().internalBuild;
 

@@ -1,0 +1,230 @@
+#include "Crash/CrashSweep.h"
+
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <chrono>
+#include <cstdio>
+#include <cstdlib>
+#include <fstream>
+
+#include "Platform/SystemRoot.h"
+#include "Support/TempRoot.h"
+
+namespace vsl::test {
+
+namespace {
+
+const char* const kCleanupComplete = "com.tarrow.vesseld.cleanup-complete";
+constexpr int kKilledStatus = 86;
+
+std::string notificationPath(const DaemonProcess& d, const char* name) {
+    return d.at(std::string("run/vesseld/notify/") + name);
+}
+
+bool posted(const DaemonProcess& d, const char* name) {
+    struct stat st;
+    return ::lstat(notificationPath(d, name).c_str(), &st) == 0;
+}
+
+// A simulated reboot: what does not survive one is gone, the keybag's state stays.
+void reboot(DaemonProcess& d) {
+    for (const std::string& name : entriesOf(d.at("run/vesseld")))
+        if (name != "keybag") removeTree(d.at(joinPath("run/vesseld", name)));
+}
+
+void forgetBoot(DaemonProcess&) {}
+
+// Starts the daemon and waits until start-up's clean-up has finished, so that none of
+// its steps is numbered as the scenario's and the checks see the repaired root.
+bool startSettled(DaemonProcess& d, const std::vector<std::string>& environment) {
+    ::unlink(notificationPath(d, kCleanupComplete).c_str());
+    return d.start(environment, [&] { return posted(d, kCleanupComplete); });
+}
+
+bool copyRoot(const std::string& from, DaemonProcess& to, const Scenario& s) {
+    std::string out, err;
+    if (runProgram({"/bin/cp", "-a", from + "/.", to.root()}, &out, &err) != 0) return false;
+    if (s.setUp) s.setUp(to);
+    return true;
+}
+
+std::string tail(const std::string& text) { return text.size() > 600 ? text.substr(text.size() - 600) : text; }
+
+std::shared_ptr<client::VSLConnection> connect(const DaemonProcess& d) {
+    return client::VSLConnection::connect(d.socketPath());
+}
+
+uint64_t budget() {
+    const char* b = std::getenv("VESSEL_CRASH_BUDGET");
+    return b ? std::strtoull(b, nullptr, 10) : 0;
+}
+
+// The root a client run leaves when killed before the step `crashAt` picks: the
+// start of the startup-scope sweep.
+std::unique_ptr<DaemonProcess> crashedRoot(const Scenario& s, const PreparedRoot& prepared, SweepResult* result) {
+    uint64_t at = 0;
+    {
+        DaemonProcess traced;
+        if (!copyRoot(prepared.daemon->root(), traced, s)) return nullptr;
+        std::string trace = traced.at("durable.trace");
+        if (!startSettled(traced, {"VESSELD_DURABLE_TRACE=" + trace})) return nullptr;
+        SweepRun run(traced, prepared, connect(traced));
+        s.drive(run);
+        traced.stop();
+        at = s.crashAt(readTrace(trace), traced.root());
+        forgetBoot(traced);
+    }
+    auto crashed = std::make_unique<DaemonProcess>();
+    if (at == 0 || !copyRoot(prepared.daemon->root(), *crashed, s) ||
+        !startSettled(*crashed, {"VESSELD_KILL_AT=" + std::to_string(at)})) {
+        result->failures.push_back(s.name + ": no crashed root to start from");
+        return nullptr;
+    }
+    SweepRun run(*crashed, prepared, connect(*crashed));
+    s.drive(run);
+    int status = crashed->waitForExit(std::chrono::seconds(10));
+    forgetBoot(*crashed);
+    if (status != kKilledStatus) {
+        result->failures.push_back(s.name + ": the client run was not killed at step " + std::to_string(at));
+        return nullptr;
+    }
+    return crashed;
+}
+
+// Waits for the kill of a start-up: -1 when start-up's clean-up finished without it.
+int waitForStartupKill(DaemonProcess& d) {
+    for (int i = 0; i < 1000; i++) {
+        int status = d.waitForExit(std::chrono::milliseconds(20));
+        if (status >= 0) return status;
+        if (posted(d, kCleanupComplete)) return d.waitForExit(std::chrono::milliseconds(300));
+    }
+    return -1;
+}
+
+void runKillPoint(const Scenario& s, const PreparedRoot& prepared, const std::string& base,
+                  const std::vector<std::string>& scopeEnvironment, uint64_t n, bool rebooting,
+                  SweepResult* result) {
+    DaemonProcess d;
+    const std::string where = s.name + " N=" + std::to_string(n) + (rebooting ? " (reboot)" : " (restart)");
+    if (!copyRoot(base, d, s)) {
+        result->failures.push_back(where + ": cannot copy the prepared root");
+        return;
+    }
+    std::vector<std::string> environment = scopeEnvironment;
+    environment.push_back("VESSELD_KILL_AT=" + std::to_string(n));
+    SweepRun run(d, prepared);
+    int status = -1;
+    if (s.startupScope) {
+        if (d.start(environment, [] { return true; })) status = waitForStartupKill(d);
+    } else {
+        if (!startSettled(d, environment)) {
+            result->failures.push_back(where + ": the daemon did not start: " + tail(readFile(d.at("vesseld.stderr"))));
+            forgetBoot(d);
+            return;
+        }
+        run.connection = connect(d);
+        s.drive(run);
+        run.connection.reset();
+        status = d.waitForExit(std::chrono::seconds(5));
+    }
+    if (status < 0) {
+        result->unreached++;
+        d.kill();
+        forgetBoot(d);
+        return;
+    }
+    if (status != kKilledStatus) {
+        result->failures.push_back(where + ": the daemon exited with status " + std::to_string(status) + ": " +
+                                   tail(readFile(d.at("vesseld.stderr"))));
+        forgetBoot(d);
+        return;
+    }
+
+    if (rebooting) reboot(d);
+    if (!startSettled(d, {})) {
+        result->failures.push_back(where + ": the repairing start failed: " + tail(readFile(d.at("vesseld.stderr"))));
+        forgetBoot(d);
+        return;
+    }
+    run.connection = connect(d);
+    checkCommonInvariants(run, s.subjects);
+    if (s.check) s.check(run);
+    run.connection.reset();
+    d.kill();
+    forgetBoot(d);
+    result->exercised++;
+    for (const std::string& f : run.failures) result->failures.push_back(where + ": " + f);
+}
+
+}  // namespace
+
+std::vector<uint64_t> killPoints(uint64_t steps, uint64_t limit) {
+    std::vector<uint64_t> points;
+    if (limit == 0 || limit >= steps) {
+        for (uint64_t n = 1; n <= steps; n++) points.push_back(n);
+        return points;
+    }
+    for (uint64_t i = 0; i < limit; i++) {
+        uint64_t n = limit == 1 ? 1 : 1 + i * (steps - 1) / (limit - 1);
+        if (points.empty() || points.back() != n) points.push_back(n);
+    }
+    return points;
+}
+
+SweepResult runSweep(const Scenario& s, const std::vector<uint64_t>& only, bool countOnly) {
+    SweepResult result;
+    const PreparedRoot& prepared = preparedRoot();
+    if (!prepared.daemon) {
+        result.failures.push_back(s.name + ": no prepared root");
+        return result;
+    }
+    std::string base = prepared.daemon->root();
+    std::unique_ptr<DaemonProcess> crashed;
+    std::vector<std::string> scopeEnvironment;
+    if (s.startupScope) {
+        crashed = crashedRoot(s, prepared, &result);
+        if (!crashed) return result;
+        base = crashed->root();
+        scopeEnvironment.push_back("VESSELD_KILL_SCOPE=startup");
+    }
+
+    // One traced run counts the steps and feeds the audit.
+    {
+        DaemonProcess d;
+        std::string trace = d.at("durable.trace");
+        std::vector<std::string> environment = scopeEnvironment;
+        environment.push_back("VESSELD_DURABLE_TRACE=" + trace);
+        if (!copyRoot(base, d, s) || !startSettled(d, environment)) {
+            result.failures.push_back(s.name + ": the traced run did not start");
+            return result;
+        }
+        if (!s.startupScope) {
+            SweepRun run(d, prepared, connect(d));
+            s.drive(run);
+        }
+        d.stop();
+        auto steps = readTrace(trace);
+        result.steps = steps.size();
+        result.auditFaults = auditRenames(steps, d.root());
+        forgetBoot(d);
+    }
+
+    if (countOnly) return result;
+    const auto points = only.empty() ? killPoints(result.steps, budget()) : only;
+    for (size_t i = 0; i < points.size(); i++)
+        runKillPoint(s, prepared, base, scopeEnvironment, points[i], i % 2 == 1, &result);
+    return result;
+}
+
+void report(const Scenario& s, const SweepResult& r) {
+    std::printf("crash sweep %s: %llu steps, %llu kill points exercised, %llu not reached, %zu invariant failures\n",
+                s.name.c_str(), static_cast<unsigned long long>(r.steps), static_cast<unsigned long long>(r.exercised),
+                static_cast<unsigned long long>(r.unreached), r.failures.size());
+    std::string directory = std::string(VESSEL_BUILD_DIR) + "/tests/crash-sweep";
+    ::mkdir(directory.c_str(), 0755);
+    std::ofstream(directory + "/" + s.name + ".txt", std::ios::trunc)
+        << r.exercised << " " << r.failures.size() << " " << r.unreached << "\n";
+}
+
+}  // namespace vsl::test
