@@ -2,8 +2,14 @@
 
 #include <fcntl.h>
 
+#include <unistd.h>
+
+#include <algorithm>
 #include <cerrno>
 #include <chrono>
+#include <condition_variable>
+#include <memory>
+#include <mutex>
 
 #include "Platform/DurableIO.h"
 #include "Platform/FileWatcher.h"
@@ -11,11 +17,6 @@
 #include "Platform/UniqueFd.h"
 
 namespace vsl {
-
-namespace {
-
-
-}  // namespace
 
 std::string notificationDirectory() { return rootedPath("/run/vesseld/notify"); }
 
@@ -38,5 +39,43 @@ uint64_t watchNotification(const std::string& name, std::function<void()> change
 }
 
 void unwatchNotification(uint64_t token) { FileWatcher::shared().unwatch(token); }
+
+int withdrawNotification(const std::string& name) {
+    if (!isPlainPathComponent(name)) return EINVAL;
+    int rc = durable::removeFile(joinPath(notificationDirectory(), name));
+    return rc == ENOENT ? 0 : rc;
+}
+
+bool waitForNotificationIn(const std::string& directory, const std::string& name,
+                           std::chrono::milliseconds timeout) {
+    if (!isPlainPathComponent(name)) return false;
+    const std::string path = joinPath(directory, name);
+    auto posted = [&] { return ::access(path.c_str(), F_OK) == 0; };
+    struct Signal {
+        std::mutex mutex;
+        std::condition_variable changed;
+        uint64_t events = 0;
+    };
+    auto signal = std::make_shared<Signal>();
+    uint64_t token = FileWatcher::shared().watch(directory, name, [signal] {
+        std::lock_guard<std::mutex> g(signal->mutex);
+        signal->events++;
+        signal->changed.notify_all();
+    });
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    bool found = posted();
+    while (!found && std::chrono::steady_clock::now() < deadline) {
+        std::unique_lock<std::mutex> lock(signal->mutex);
+        uint64_t seen = signal->events;
+        // The watch is the fast path; the periodic look covers a directory that could
+        // not be watched and a change the watcher has not delivered yet.
+        auto slice = std::min(deadline, std::chrono::steady_clock::now() + std::chrono::milliseconds(200));
+        signal->changed.wait_until(lock, slice, [&] { return signal->events != seen; });
+        lock.unlock();
+        found = posted();
+    }
+    if (token) FileWatcher::shared().unwatch(token);
+    return found;
+}
 
 }  // namespace vsl

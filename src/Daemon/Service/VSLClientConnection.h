@@ -136,6 +136,10 @@ public:
     void deleteContainersOnDeathRowWithCompletion(std::function<void(uint64_t)> completion);
     // True when the item is on death row or no longer exists.
     bool _moveItemAtURLToDeathRow(const std::string& url, bool isDir, bool startDeletionThread, VSLErrorRef* error);
+    // Start-up clean-ups (VSLClientConnectionCleanup.cpp). Both return at once; the work
+    // and the completion run on the background queue. Every start: staging items of the
+    // last process go to death row, then death row is destroyed.
+    void vesselCleanupWithCompletion(std::function<void()> completion);
     // True when the item is gone from its place (removed, or moved to /tmp).
     bool _removeItemOrMoveToTempAtURL(const std::string& url, VSLErrorRef* error);
 

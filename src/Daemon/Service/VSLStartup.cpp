@@ -6,8 +6,10 @@
 
 #include <cstdio>
 #include <cstdlib>
+#include <memory>
 #include <string>
 
+#include "Client/VSLNotification.h"
 #include "Daemon/CodeSigning/VSLCodeSigningMapping.h"
 #include "Daemon/Concurrency/VSLDataProtectionManager.h"
 #include "Daemon/Service/VSLClientConnection.h"
@@ -19,6 +21,7 @@
 #include "Platform/DeviceFacts.h"
 #include "Platform/DurableIO.h"
 #include "Platform/Log.h"
+#include "Platform/Notification.h"
 #include "Platform/SandboxState.h"
 #include "Platform/SystemRoot.h"
 
@@ -44,6 +47,10 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     }
     setCrashAnnotationFile(joinPath(options.directory, "vesseld.crash"));
     LogWrite(kLogLevelDebug, "vesseld_init", "vesseld built at %s %s started", __DATE__, __TIME__);
+
+    // A notification of the last process must not be taken for one of this process.
+    if (int rc = withdrawNotification(client::kCleanupCompleteNotification))
+        LogWrite(kLogLevelError, "vesseld_init", "Failed to withdraw cleanup-complete: %d", rc);
 
     if (!deathRowQueue() || !lockStateQueue()) {
         LogWrite(kLogLevelError, "vesseld_init", "Can't create dispatch queues.");
@@ -84,8 +91,14 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
         ::_exit(1);
     }
 
-    // Every start: whatever a crash left on death row is destroyed in the background.
-    VSLClientConnection::sharedClientConnection()->deleteContainersOnDeathRowWithCompletion(nullptr);
+    // Every start: staging leftovers and whatever a crash left on death row are
+    // destroyed in the background; waiters learn of it by the notification.
+    auto bootCleanup = std::make_shared<SignpostInterval>(LogCategory::Startup, "BootCleanup", "");
+    VSLClientConnection::sharedClientConnection()->vesselCleanupWithCompletion([bootCleanup] {
+        if (int rc = postNotification(client::kCleanupCompleteNotification))
+            LogWrite(kLogLevelError, "vesseld_init", "Failed to post cleanup-complete: %u", rc);
+        bootCleanup->end("");
+    });
 
     interval.end("");
     transaction->close();

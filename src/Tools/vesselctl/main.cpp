@@ -15,6 +15,7 @@
 #include "Keybag.h"
 #include "Subcommands.h"
 #include "Upcall.h"
+#include "Wait.h"
 
 using namespace vsl;
 using namespace vsl::client;
@@ -43,6 +44,7 @@ int usage(FILE* out) {
                  "  OldIdentifier=ID OldContainerClass=N OldContainerUUID=UUID [OldPersonaUniqueString=S]\n"
                  "  NewIdentifier=ID NewContainerClass=N NewContainerUUID=UUID [NewPersonaUniqueString=S]\n"
                  "  Without the Old keys the new container is made permanent in its class.\n");
+    std::fprintf(out, "%s", kWaitUsage);
     return out == stdout ? 0 : 2;
 }
 
@@ -83,6 +85,7 @@ int main(int argc, char** argv) {
     }
 
     if (std::string(argv[i]) == "keybag") return runKeybagCommand(root, argc - i, argv + i, asJson);
+    if (std::string(argv[i]) == "wait") return runWaitCommand(root, timeoutSeconds, argc - i, argv + i);
 
     std::string subcommandError;
     std::optional<Dictionary> subcommand = subcommandRequest(argc, argv, &i, &subcommandError);
