@@ -13,7 +13,10 @@
 #include <cstdio>
 #include <cstdlib>
 #include <mutex>
+#include <string>
+#include <vector>
 
+#include "Platform/DirectoryEntries.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
 #include "Platform/Value.h"
@@ -216,17 +219,43 @@ int writeFile(const std::string& path, const void* data, size_t length, mode_t m
     return rc;
 }
 
+namespace {
+constexpr const char* kTemporarySuffix = ".tmp-";
+constexpr size_t kUuidLength = 36;
+}  // namespace
+
 int writeFileAtomically(const std::string& path, const void* data, size_t length, mode_t mode) {
     // Appended piece by piece: GCC 12 at -O3 warns (falsely) about operator+ chains here.
     std::string name = ".";
     name += lastPathComponent(path);
-    name += ".tmp-";
+    name += kTemporarySuffix;
     name += Uuid::random().string();
     std::string temp = joinPath(parentPath(path), name);
     if (int rc = writeFile(temp, data, length, mode)) return rc;
     int rc = renameAndSync(temp, path, false);  // writeFile synced the data
     if (rc) ::unlink(temp.c_str());
     return rc;
+}
+
+bool isTemporaryFileName(const std::string& name) {
+    const size_t suffix = std::char_traits<char>::length(kTemporarySuffix) + kUuidLength;
+    return name.size() > suffix + 1 && name[0] == '.' &&
+           name.compare(name.size() - suffix, suffix - kUuidLength, kTemporarySuffix) == 0 &&
+           Uuid::parse(name.substr(name.size() - kUuidLength)).has_value();
+}
+
+int removeTemporaryFiles(const std::string& directory) {
+    UniqueFd fd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC | O_NOFOLLOW));
+    if (!fd.valid()) return errno == ENOENT ? 0 : errno;
+    std::vector<DirectoryEntry> entries;
+    if (int rc = readDirectoryEntries(fd.get(), &entries)) return rc;
+    int first = 0;
+    for (const DirectoryEntry& e : entries) {
+        if (!isTemporaryFileName(e.name)) continue;
+        int rc = removeAt(fd.get(), e.name.c_str(), false, joinPath(directory, e.name));
+        if (rc != 0 && rc != ENOENT && first == 0) first = rc;
+    }
+    return first;
 }
 
 int makeTemporaryDirectory(std::string* templ) {

@@ -56,6 +56,11 @@ int renameDurably(const std::string& from, const std::string& to);
 int writeFile(const std::string& path, const void* data, size_t length, mode_t mode);
 // Temporary file beside `path`, fsync, rename over `path`, fsync of the directory.
 int writeFileAtomically(const std::string& path, const void* data, size_t length, mode_t mode);
+// The temporary files of writeFileAtomically (".NAME.tmp-UUID"): hidden from the
+// daemon's listings, so a crash between the write and the rename would leave one for
+// ever. Removed at start-up from the directories of the daemon's own files.
+bool isTemporaryFileName(const std::string& name);
+int removeTemporaryFiles(const std::string& directory);  // 0 or the first errno
 // mkdtemp: `templ` ends in "XXXXXX" and is filled in on success.
 int makeTemporaryDirectory(std::string* templ);
 

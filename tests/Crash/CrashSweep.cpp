@@ -7,15 +7,17 @@
 #include <cstdio>
 #include <cstdlib>
 #include <fstream>
+#include <thread>
 
 #include "Platform/SystemRoot.h"
+#include "Support/Boot.h"
 #include "Support/TempRoot.h"
 
 namespace vsl::test {
 
 namespace {
 
-const char* const kCleanupComplete = "com.tarrow.vesseld.cleanup-complete";
+const char* const kCleanupComplete = client::kCleanupCompleteNotification;
 constexpr int kKilledStatus = 86;
 
 std::string notificationPath(const DaemonProcess& d, const char* name) {
@@ -36,17 +38,25 @@ void reboot(DaemonProcess& d) {
 void forgetBoot(DaemonProcess&) {}
 
 // Starts the daemon and waits until start-up's clean-up has finished, so that none of
-// its steps is numbered as the scenario's and the checks see the repaired root.
+// its steps is numbered as the scenario's and the checks see the repaired root. No
+// request is sent before: the first one starts the numbering.
 bool startSettled(DaemonProcess& d, const std::vector<std::string>& environment) {
-    ::unlink(notificationPath(d, kCleanupComplete).c_str());
-    return d.start(environment, [&] { return posted(d, kCleanupComplete); });
+    ::unlink(notificationPath(d, kCleanupComplete).c_str());  // the copy's, or the killed daemon's
+    return d.start(environment, [] { return true; }) &&
+           waitForNotification(d, kCleanupComplete, std::chrono::seconds(60));
 }
 
 bool copyRoot(const std::string& from, DaemonProcess& to, const Scenario& s) {
     std::string out, err;
     if (runProgram({"/bin/cp", "-a", from + "/.", to.root()}, &out, &err) != 0) return false;
+    ::unlink(notificationPath(to, kCleanupComplete).c_str());  // posted by the daemon that made the copy
     if (s.setUp) s.setUp(to);
     return true;
+}
+
+off_t fileSize(const std::string& path) {
+    struct stat st;
+    return ::stat(path.c_str(), &st) == 0 ? st.st_size : 0;
 }
 
 std::string tail(const std::string& text) { return text.size() > 600 ? text.substr(text.size() - 600) : text; }
@@ -97,7 +107,7 @@ int waitForStartupKill(DaemonProcess& d) {
     for (int i = 0; i < 1000; i++) {
         int status = d.waitForExit(std::chrono::milliseconds(20));
         if (status >= 0) return status;
-        if (posted(d, kCleanupComplete)) return d.waitForExit(std::chrono::milliseconds(300));
+        if (posted(d, kCleanupComplete)) { if (getenv("DBG")) fprintf(stderr, "DBG posted at %d\n", i); return d.waitForExit(std::chrono::milliseconds(300)); }
     }
     return -1;
 }
@@ -113,6 +123,7 @@ void runKillPoint(const Scenario& s, const PreparedRoot& prepared, const std::st
     }
     std::vector<std::string> environment = scopeEnvironment;
     environment.push_back("VESSELD_KILL_AT=" + std::to_string(n));
+    if (getenv("DBG")) environment.push_back("VESSELD_DURABLE_TRACE=/tmp/crash-dbg.trace");
     SweepRun run(d, prepared);
     int status = -1;
     if (s.startupScope) {
@@ -130,6 +141,7 @@ void runKillPoint(const Scenario& s, const PreparedRoot& prepared, const std::st
     }
     if (status < 0) {
         result->unreached++;
+        result->unreachedPoints.push_back(n);
         d.kill();
         forgetBoot(d);
         return;
@@ -203,9 +215,16 @@ SweepResult runSweep(const Scenario& s, const std::vector<uint64_t>& only, bool 
             SweepRun run(d, prepared, connect(d));
             s.drive(run);
         }
-        d.stop();
+        // Work the scenario left in the background (death row destroyed after a
+        // reply) counts too; a clean stop's own steps do not, no kill run gets there.
+        for (off_t size = -1; size != fileSize(trace);) {
+            size = fileSize(trace);
+            std::this_thread::sleep_for(std::chrono::milliseconds(300));
+        }
+        d.kill();
         auto steps = readTrace(trace);
         result.steps = steps.size();
+        result.trace = steps;
         result.auditFaults = auditRenames(steps, d.root());
         forgetBoot(d);
     }
@@ -213,7 +232,7 @@ SweepResult runSweep(const Scenario& s, const std::vector<uint64_t>& only, bool 
     if (countOnly) return result;
     const auto points = only.empty() ? killPoints(result.steps, budget()) : only;
     for (size_t i = 0; i < points.size(); i++)
-        runKillPoint(s, prepared, base, scopeEnvironment, points[i], i % 2 == 1, &result);
+        runKillPoint(s, prepared, base, scopeEnvironment, points[i], points[i] % 2 == 1, &result);
     return result;
 }
 

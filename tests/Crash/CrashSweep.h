@@ -112,8 +112,10 @@ struct SweepResult {
     uint64_t steps = 0;        // S
     uint64_t exercised = 0;    // kill points reached and checked
     uint64_t unreached = 0;    // N the daemon never got to
+    std::vector<uint64_t> unreachedPoints;
     std::vector<std::string> failures;  // "<scenario> N=<n>: <invariant>"
     std::vector<std::string> auditFaults;
+    std::vector<TraceStep> trace;  // of the traced run
 };
 
 // Every scenario of the sweep, by name.

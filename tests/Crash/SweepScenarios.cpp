@@ -217,7 +217,8 @@ Scenario wipe() {
             run.fail("the wiped container is absent (code " + std::to_string(l.code) + ")");
             return;
         }
-        run.expect(l.uuid == old.uuid && l.path == old.path, "the wiped container lost its identity or place");
+        run.expect(l.uuid == old.uuid && l.path == old.path, "the wiped container lost its identity or place: " +
+                                                                 l.uuid + " at " + l.path);
         const bool wiped = holdsNoneOf(run, l.path, old);
         run.expect(wiped || holdsFiles(run, l.path, old), "the wiped container is neither old nor new");
         if (run.acknowledged("wipe")) run.expect(wiped, "an acknowledged wipe was undone");

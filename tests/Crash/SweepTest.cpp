@@ -20,16 +20,34 @@ std::string joined(const std::vector<std::string>& lines, size_t limit = 20) {
     return out;
 }
 
+// VESSEL_CRASH_POINTS=N,M,... repeats chosen kill points of a failure.
+std::vector<uint64_t> chosenPoints() {
+    std::vector<uint64_t> points;
+    if (const char* list = std::getenv("VESSEL_CRASH_POINTS"))
+        for (char* p = const_cast<char*>(list); *p;) {
+            char* end = nullptr;
+            points.push_back(std::strtoull(p, &end, 10));
+            p = *end ? end + 1 : end;
+        }
+    return points;
+}
+
 void sweep(const std::string& name) {
     const Scenario& s = scenarioNamed(name);
     ASSERT_EQ(name, s.name);
-    SweepResult r = runSweep(s);
+    SweepResult r = runSweep(s, chosenPoints());
     report(s, r);
     EXPECT_GT(r.exercised, 0u);
     EXPECT_TRUE(r.auditFaults.empty()) << "durable-write audit:\n" << joined(r.auditFaults);
     EXPECT_TRUE(r.failures.empty()) << joined(r.failures);
     // A step count that changes from run to run would leave kill points untried.
-    EXPECT_LE(r.unreached * 20, r.exercised + r.unreached) << r.unreached << " kill points never reached";
+    std::string unreached;
+    for (uint64_t n : r.unreachedPoints) unreached += " " + std::to_string(n);
+    EXPECT_LE(r.unreached * 20, r.exercised + r.unreached) << "kill points never reached:" << unreached;
+    if (std::getenv("VESSEL_CRASH_SHOW_TRACE"))
+        for (const TraceStep& t : r.trace)
+            std::printf("%llu %s %s%s\n", static_cast<unsigned long long>(t.n), t.kind.c_str(),
+                        t.from.empty() ? "" : (t.from + " -> ").c_str(), t.path.c_str());
 }
 
 }  // namespace

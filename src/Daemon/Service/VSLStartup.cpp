@@ -70,6 +70,14 @@ void vesseld_init(std::shared_ptr<Transaction> transaction) {
     if (int rc = SandboxState::removeTemporaryFiles())
         LogWrite(kLogLevelError, "vesseld_init", "Failed to remove temporary sandbox files: %d", rc);
 
+    // An atomic rewrite that a kill stopped before its rename leaves a temporary file no
+    // listing sees: journals, pending updates and status files are whole or absent.
+    for (const std::string& directory : {VSLGlobalConfiguration::sharedInstance()->replaceDirectory(),
+                                         VSLGlobalConfiguration::sharedInstance()->pendingUpdatesDirectory(),
+                                         VSLGlobalConfiguration::sharedInstance()->libraryDirectory()})
+        if (int rc = durable::removeTemporaryFiles(directory))
+            LogWrite(kLogLevelError, "vesseld_init", "Failed to remove temporary files in %s: %d", directory, rc);
+
     // Every start: replacements a crash interrupted are settled before anything looks
     // at containers; their journals go to death row.
     VSLErrorRef replaceError;
