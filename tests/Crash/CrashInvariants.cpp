@@ -45,7 +45,10 @@ std::optional<Value> readPropertyList(const std::string& path) {
 
 bool SweepRun::send(const Value& request, const std::string& name, Value* reply) {
     auto r = connection ? connection->sendRequest(request, std::chrono::seconds(30)) : client::VSLReply{};
-    if (!r.ok()) return false;
+    if (!r.ok()) {
+        lastError = connection ? client::statusName(r.status) + std::string(": ") + r.error : "not connected";
+        return false;
+    }
     codes[name] = client::replyCode(r);
     if (reply) *reply = r.body;
     return true;
@@ -61,7 +64,11 @@ Lookup lookUp(SweepRun& run, const std::string& identifier, uint64_t containerCl
     Value request = createRequest(identifier, containerClass, false, false);
     Value reply;
     if (!run.send(request, "lookup " + identifier, &reply)) {
-        run.fail("no answer to a lookup of " + identifier);
+        std::string log = readFile(run.daemon.at("vesseld.stderr"));
+        const int status = run.daemon.waitForExit(std::chrono::milliseconds(0));
+        run.fail("no answer to a lookup of " + identifier + " (" + run.lastError + "); the daemon " +
+                 (status < 0 ? "runs" : "exited with " + std::to_string(status)) + "; its output ends: " +
+                 log.substr(log.size() > 400 ? log.size() - 400 : 0));
         return l;
     }
     l.code = run.codes["lookup " + identifier];

@@ -70,36 +70,30 @@ uint64_t budget() {
     return b ? std::strtoull(b, nullptr, 10) : 0;
 }
 
-// The root a client run leaves when killed before the step `crashAt` picks: the
-// start of the startup-scope sweep.
-std::unique_ptr<DaemonProcess> crashedRoot(const Scenario& s, const PreparedRoot& prepared, SweepResult* result) {
-    uint64_t at = 0;
-    {
-        DaemonProcess traced;
-        if (!copyRoot(prepared.daemon->root(), traced, s)) return nullptr;
-        std::string trace = traced.at("durable.trace");
-        if (!startSettled(traced, {"VESSELD_DURABLE_TRACE=" + trace})) return nullptr;
-        SweepRun run(traced, prepared, connect(traced));
-        s.drive(run);
-        traced.stop();
-        at = s.crashAt(readTrace(trace), traced.root());
-        forgetBoot(traced);
-    }
-    auto crashed = std::make_unique<DaemonProcess>();
-    if (at == 0 || !copyRoot(prepared.daemon->root(), *crashed, s) ||
-        !startSettled(*crashed, {"VESSELD_KILL_AT=" + std::to_string(at)})) {
-        result->failures.push_back(s.name + ": no crashed root to start from");
-        return nullptr;
-    }
-    SweepRun run(*crashed, prepared, connect(*crashed));
+// The step `crashAt` picks from a traced client run: a startup-scope sweep begins
+// from the root that run leaves when killed there. Each kill point makes that root
+// afresh: journals name their containers by absolute path, so a copy of a crashed
+// root would repair the original.
+uint64_t crashPoint(const Scenario& s, const PreparedRoot& prepared) {
+    DaemonProcess traced;
+    if (!copyRoot(prepared.daemon->root(), traced, s)) return 0;
+    std::string trace = traced.at("durable.trace");
+    if (!startSettled(traced, {"VESSELD_DURABLE_TRACE=" + trace})) return 0;
+    SweepRun run(traced, prepared, connect(traced));
     s.drive(run);
-    int status = crashed->waitForExit(std::chrono::seconds(10));
-    forgetBoot(*crashed);
-    if (status != kKilledStatus) {
-        result->failures.push_back(s.name + ": the client run was not killed at step " + std::to_string(at));
-        return nullptr;
-    }
-    return crashed;
+    traced.kill();
+    return s.crashAt(readTrace(trace), traced.root());
+}
+
+// A copy of the prepared root, crashed at `crashAt` when the sweep starts from one.
+bool makeRoot(const Scenario& s, const PreparedRoot& prepared, uint64_t crashAt, DaemonProcess& d) {
+    if (!copyRoot(prepared.daemon->root(), d, s)) return false;
+    if (crashAt == 0) return true;
+    if (!startSettled(d, {"VESSELD_KILL_AT=" + std::to_string(crashAt)})) return false;
+    SweepRun run(d, prepared, connect(d));
+    s.drive(run);
+    run.connection.reset();
+    return d.waitForExit(std::chrono::seconds(10)) == kKilledStatus;
 }
 
 // Waits for the kill of a start-up: -1 when start-up's clean-up finished without it.
@@ -107,23 +101,22 @@ int waitForStartupKill(DaemonProcess& d) {
     for (int i = 0; i < 1000; i++) {
         int status = d.waitForExit(std::chrono::milliseconds(20));
         if (status >= 0) return status;
-        if (posted(d, kCleanupComplete)) { if (getenv("DBG")) fprintf(stderr, "DBG posted at %d\n", i); return d.waitForExit(std::chrono::milliseconds(300)); }
+        if (posted(d, kCleanupComplete)) return d.waitForExit(std::chrono::milliseconds(300));
     }
     return -1;
 }
 
-void runKillPoint(const Scenario& s, const PreparedRoot& prepared, const std::string& base,
+void runKillPoint(const Scenario& s, const PreparedRoot& prepared, uint64_t crashAt,
                   const std::vector<std::string>& scopeEnvironment, uint64_t n, bool rebooting,
                   SweepResult* result) {
     DaemonProcess d;
     const std::string where = s.name + " N=" + std::to_string(n) + (rebooting ? " (reboot)" : " (restart)");
-    if (!copyRoot(base, d, s)) {
-        result->failures.push_back(where + ": cannot copy the prepared root");
+    if (!makeRoot(s, prepared, crashAt, d)) {
+        result->failures.push_back(where + ": cannot make the root to start from");
         return;
     }
     std::vector<std::string> environment = scopeEnvironment;
     environment.push_back("VESSELD_KILL_AT=" + std::to_string(n));
-    if (getenv("DBG")) environment.push_back("VESSELD_DURABLE_TRACE=/tmp/crash-dbg.trace");
     SweepRun run(d, prepared);
     int status = -1;
     if (s.startupScope) {
@@ -191,13 +184,14 @@ SweepResult runSweep(const Scenario& s, const std::vector<uint64_t>& only, bool 
         result.failures.push_back(s.name + ": no prepared root");
         return result;
     }
-    std::string base = prepared.daemon->root();
-    std::unique_ptr<DaemonProcess> crashed;
+    uint64_t crashAt = 0;
     std::vector<std::string> scopeEnvironment;
     if (s.startupScope) {
-        crashed = crashedRoot(s, prepared, &result);
-        if (!crashed) return result;
-        base = crashed->root();
+        crashAt = crashPoint(s, prepared);
+        if (crashAt == 0) {
+            result.failures.push_back(s.name + ": no step to crash the client run at");
+            return result;
+        }
         scopeEnvironment.push_back("VESSELD_KILL_SCOPE=startup");
     }
 
@@ -207,7 +201,7 @@ SweepResult runSweep(const Scenario& s, const std::vector<uint64_t>& only, bool 
         std::string trace = d.at("durable.trace");
         std::vector<std::string> environment = scopeEnvironment;
         environment.push_back("VESSELD_DURABLE_TRACE=" + trace);
-        if (!copyRoot(base, d, s) || !startSettled(d, environment)) {
+        if (!makeRoot(s, prepared, crashAt, d) || !startSettled(d, environment)) {
             result.failures.push_back(s.name + ": the traced run did not start");
             return result;
         }
@@ -225,6 +219,7 @@ SweepResult runSweep(const Scenario& s, const std::vector<uint64_t>& only, bool 
         auto steps = readTrace(trace);
         result.steps = steps.size();
         result.trace = steps;
+        result.root = d.root();
         result.auditFaults = auditRenames(steps, d.root());
         forgetBoot(d);
     }
@@ -232,7 +227,7 @@ SweepResult runSweep(const Scenario& s, const std::vector<uint64_t>& only, bool 
     if (countOnly) return result;
     const auto points = only.empty() ? killPoints(result.steps, budget()) : only;
     for (size_t i = 0; i < points.size(); i++)
-        runKillPoint(s, prepared, base, scopeEnvironment, points[i], points[i] % 2 == 1, &result);
+        runKillPoint(s, prepared, crashAt, scopeEnvironment, points[i], points[i] % 2 == 1, &result);
     return result;
 }
 

@@ -61,6 +61,7 @@ struct SweepRun {
     std::map<std::string, uint64_t> codes;
     std::map<std::string, std::string> values;
     std::vector<std::string> failures;  // invariants broken, one line each
+    std::string lastError;              // why the last request got no answer
     // Containers found in class directories, by "<identifier> in <class directory>".
     std::map<std::string, int> onDisk;
 
@@ -116,6 +117,7 @@ struct SweepResult {
     std::vector<std::string> failures;  // "<scenario> N=<n>: <invariant>"
     std::vector<std::string> auditFaults;
     std::vector<TraceStep> trace;  // of the traced run
+    std::string root;              // where the traced run ran (gone now)
 };
 
 // Every scenario of the sweep, by name.
