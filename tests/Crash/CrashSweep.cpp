@@ -61,8 +61,14 @@ off_t fileSize(const std::string& path) {
 
 std::string tail(const std::string& text) { return text.size() > 600 ? text.substr(text.size() - 600) : text; }
 
+// The clean-up can finish before the listener has bound its socket: wait (bounded)
+// for it to answer a connection.
 std::shared_ptr<client::VSLConnection> connect(const DaemonProcess& d) {
-    return client::VSLConnection::connect(d.socketPath());
+    for (int i = 0; i < 2000; i++) {
+        if (auto c = client::VSLConnection::connect(d.socketPath())) return c;
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    }
+    return nullptr;
 }
 
 uint64_t budget() {

@@ -132,12 +132,14 @@ Scenario stageSeveral() {
             identifiers.push_back(Value::string(c.identifier));
             personas.push_back(Value::string(""));
         }
-        run.send(dict({{"Command", Value::uint64(3)},
-                       {"ContainerClassesArray", Value::array(classes)},
-                       {"UUIDsArray", Value::array(uuids)},
-                       {"IdentifiersArray", Value::array(identifiers)},
-                       {"PersonaUniqueStringsArray", Value::array(personas)}}),
-                 "stage");
+        if (!run.send(dict({{"Command", Value::uint64(3)},
+                            {"ContainerClassesArray", Value::array(classes)},
+                            {"UUIDsArray", Value::array(uuids)},
+                            {"IdentifiersArray", Value::array(identifiers)},
+                            {"PersonaUniqueStringsArray", Value::array(personas)}}),
+                      "stage"))
+            return;
+        run.send(dict({{"Command", Value::uint64(4)}}), "destroy");
     };
     s.check = [](SweepRun& run) {
         for (int i = 1; i <= 3; i++) checkRemoved(run, *run.prepared.find(kStagedPrefix + std::to_string(i)), "stage");
