@@ -13,7 +13,10 @@
 #include <cstdio>
 #include <cstdlib>
 #include <mutex>
+#include <string>
+#include <vector>
 
+#include "Platform/DirectoryEntries.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
 #include "Platform/Value.h"
@@ -23,11 +26,15 @@ namespace vsl::durable {
 namespace {
 #ifdef VESSEL_KILLPOINTS
 std::atomic<uint64_t> gSteps{0};
+// Steps numbered since the selected scope began; 0 while it has not.
+std::atomic<uint64_t> gNumbered{0};
+std::atomic<bool> gScopeBegun{false};
 
 struct KillConfig {
     uint64_t killAt = 0;
     std::string traceFile;
     std::string dropFsync;  // "item" or "parent": a fault the rename audit must catch
+    Scope scope = Scope::ClientMessages;
 };
 const KillConfig& killConfig() {
     static const KillConfig c = [] {
@@ -35,6 +42,8 @@ const KillConfig& killConfig() {
         if (const char* s = std::getenv("VESSELD_KILL_AT")) k.killAt = std::strtoull(s, nullptr, 10);
         if (const char* s = std::getenv("VESSELD_DURABLE_TRACE")) k.traceFile = s;
         if (const char* s = std::getenv("VESSELD_TEST_DROP_FSYNC")) k.dropFsync = s;
+        if (const char* s = std::getenv("VESSELD_KILL_SCOPE"); s && std::string(s) == "startup")
+            k.scope = Scope::Startup;
         return k;
     }();
     return c;
@@ -93,8 +102,14 @@ int copyByReadWrite(int from, int to) {
 std::string descriptorPath(int fd) { return "/proc/self/fd/" + std::to_string(fd); }
 
 #ifdef VESSEL_KILLPOINTS
+void beginScope(Scope scope) {
+    if (scope == killConfig().scope) gScopeBegun.store(true);
+}
+
 void step(const char* kind, const std::string& path) {
-    uint64_t n = ++gSteps;
+    ++gSteps;
+    if (!gScopeBegun.load()) return;
+    uint64_t n = ++gNumbered;
     const KillConfig& k = killConfig();
     if (!k.traceFile.empty()) {
         static std::mutex traceMutex;
@@ -204,17 +219,43 @@ int writeFile(const std::string& path, const void* data, size_t length, mode_t m
     return rc;
 }
 
+namespace {
+constexpr const char* kTemporarySuffix = ".tmp-";
+constexpr size_t kUuidLength = 36;
+}  // namespace
+
 int writeFileAtomically(const std::string& path, const void* data, size_t length, mode_t mode) {
     // Appended piece by piece: GCC 12 at -O3 warns (falsely) about operator+ chains here.
     std::string name = ".";
     name += lastPathComponent(path);
-    name += ".tmp-";
+    name += kTemporarySuffix;
     name += Uuid::random().string();
     std::string temp = joinPath(parentPath(path), name);
     if (int rc = writeFile(temp, data, length, mode)) return rc;
     int rc = renameAndSync(temp, path, false);  // writeFile synced the data
     if (rc) ::unlink(temp.c_str());
     return rc;
+}
+
+bool isTemporaryFileName(const std::string& name) {
+    const size_t suffix = std::char_traits<char>::length(kTemporarySuffix) + kUuidLength;
+    return name.size() > suffix + 1 && name[0] == '.' &&
+           name.compare(name.size() - suffix, suffix - kUuidLength, kTemporarySuffix) == 0 &&
+           Uuid::parse(name.substr(name.size() - kUuidLength)).has_value();
+}
+
+int removeTemporaryFiles(const std::string& directory) {
+    UniqueFd fd(::open(directory.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC | O_NOFOLLOW));
+    if (!fd.valid()) return errno == ENOENT ? 0 : errno;
+    std::vector<DirectoryEntry> entries;
+    if (int rc = readDirectoryEntries(fd.get(), &entries)) return rc;
+    int first = 0;
+    for (const DirectoryEntry& e : entries) {
+        if (!isTemporaryFileName(e.name)) continue;
+        int rc = removeAt(fd.get(), e.name.c_str(), false, joinPath(directory, e.name));
+        if (rc != 0 && rc != ENOENT && first == 0) first = rc;
+    }
+    return first;
 }
 
 int makeTemporaryDirectory(std::string* templ) {

@@ -3,7 +3,10 @@
 // through here so that crash tests can count them: in builds with
 // VESSEL_KILLPOINTS, VESSELD_KILL_AT=N exits with status 86 just before the Nth step
 // and VESSELD_DURABLE_TRACE=FILE appends "<n> <kind> <path>" for each (the path of a
-// rename is "<from> -> <to>"). Functions return 0 or an errno value.
+// rename is "<from> -> <to>"). Steps are numbered from the first client message, or,
+// with VESSELD_KILL_SCOPE=startup, from the beginning of start-up, so that a crash
+// during the repair of an earlier one is exercised too. Functions return 0 or an
+// errno value.
 #pragma once
 
 #include <sys/acl.h>
@@ -16,11 +19,18 @@
 
 namespace vsl::durable {
 
+// Where the numbering of VESSELD_KILL_AT and the trace begins.
+enum class Scope { Startup, ClientMessages };
+
 #ifdef VESSEL_KILLPOINTS
 void step(const char* kind, const std::string& path);
-uint64_t stepCount();
+uint64_t stepCount();  // every step of the process, numbered or not
+// Starts the numbering when `scope` is the one VESSELD_KILL_SCOPE selects; later
+// calls change nothing.
+void beginScope(Scope scope);
 #else
 inline void step(const char*, const std::string&) {}  // release builds count nothing
+inline void beginScope(Scope) {}
 #endif
 
 int makeDirectory(const std::string& path, mode_t mode);
@@ -46,6 +56,11 @@ int renameDurably(const std::string& from, const std::string& to);
 int writeFile(const std::string& path, const void* data, size_t length, mode_t mode);
 // Temporary file beside `path`, fsync, rename over `path`, fsync of the directory.
 int writeFileAtomically(const std::string& path, const void* data, size_t length, mode_t mode);
+// The temporary files of writeFileAtomically (".NAME.tmp-UUID"): hidden from the
+// daemon's listings, so a crash between the write and the rename would leave one for
+// ever. Removed at start-up from the directories of the daemon's own files.
+bool isTemporaryFileName(const std::string& name);
+int removeTemporaryFiles(const std::string& directory);  // 0 or the first errno
 // mkdtemp: `templ` ends in "XXXXXX" and is filled in on success.
 int makeTemporaryDirectory(std::string* templ);
 

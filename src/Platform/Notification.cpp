@@ -15,6 +15,7 @@
 #include "Platform/FileWatcher.h"
 #include "Platform/SystemRoot.h"
 #include "Platform/UniqueFd.h"
+#include "Platform/Value.h"
 
 namespace vsl {
 
@@ -24,10 +25,17 @@ int postNotification(const std::string& name) {
     if (!isPlainPathComponent(name)) return EINVAL;
     UniqueFd dir;
     if (int rc = durable::makeDirectoryNoFollow(notificationDirectory(), 0755, true, dir.out())) return rc;
-    // The content only has to change; watchers see the rename either way.
+    // The content only has to change; watchers see the rename either way. Nothing
+    // under run/ outlives a reboot, so the rename is not synced: it is the post's last
+    // step, and a waiter that sees the notification sees a finished post.
     std::string stamp =
         std::to_string(std::chrono::system_clock::now().time_since_epoch().count()) + "\n";
-    return durable::writeFileAtomically(joinPath(notificationDirectory(), name), stamp.data(), stamp.size(), 0644);
+    const std::string path = joinPath(notificationDirectory(), name);
+    const std::string temp = joinPath(notificationDirectory(), "." + name + ".tmp-" + Uuid::random().string());
+    int rc = durable::writeFile(temp, stamp.data(), stamp.size(), 0644);
+    if (rc == 0) rc = durable::renamePath(temp, path);
+    if (rc != 0) ::unlink(temp.c_str());
+    return rc;
 }
 
 uint64_t watchNotification(const std::string& name, std::function<void()> changed) {

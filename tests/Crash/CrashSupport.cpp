@@ -2,6 +2,7 @@
 
 
 #include <fstream>
+#include <iterator>
 #include <set>
 #include <sstream>
 
@@ -35,29 +36,42 @@ std::vector<TraceStep> readTrace(const std::string& file) {
 std::vector<std::string> auditRenames(const std::vector<TraceStep>& steps, const std::string& root) {
     std::vector<std::string> faults;
     const std::string volatilePrefix = joinPath(root, "run") + "/";
-    size_t previousRename = 0;
+    // Items whose content is on disk as it stands: fsynced (or written, which syncs)
+    // with nothing changed inside since. A rename carries the state to the new name.
+    std::set<std::string> synced;
+    // Items the trace never changed were synced by the process that made them.
+    std::set<std::string> touched;
+    auto touch = [&](std::string path) {
+        for (; path.size() > root.size(); path = parentPath(path))
+            if (!touched.insert(path).second) break;
+    };
+    auto isInside = [](const std::string& path, const std::string& directory) {
+        return path.size() > directory.size() && path.compare(0, directory.size(), directory) == 0 &&
+               path[directory.size()] == '/';
+    };
     for (size_t i = 0; i < steps.size(); i++) {
-        if (steps[i].kind != "rename") continue;
-        const TraceStep& r = steps[i];
-        size_t since = previousRename;
-        previousRename = i + 1;
-        if (r.path.compare(0, volatilePrefix.size(), volatilePrefix) == 0) continue;
-        std::string what = r.from + " -> " + r.path;
-        if (r.from.empty()) {
-            faults.push_back("rename without its source: " + r.path);
+        const TraceStep& s = steps[i];
+        if (s.kind == "fsync") {
+            synced.insert(s.path);
             continue;
         }
-        // The source's last sync (or the write that made a file) must come after every
-        // change made inside it.
-        bool sourceSynced = false;
-        const std::string inside = r.from + "/";
-        for (size_t j = since; j < i; j++) {
-            const TraceStep& s = steps[j];
-            if ((s.kind == "fsync" || s.kind == "write") && s.path == r.from) sourceSynced = true;
-            if (s.kind != "fsync" && s.path.compare(0, inside.size(), inside) == 0) sourceSynced = false;
+        if (s.kind == "write") synced.insert(s.path);
+        const bool fromUntouched = s.kind == "rename" && !touched.count(s.from);
+        touch(s.path);
+        if (!s.from.empty()) touch(s.from);
+        for (auto it = synced.begin(); it != synced.end();)
+            it = isInside(s.path, *it) || (s.kind == "rename" && isInside(s.from, *it)) ? synced.erase(it) : std::next(it);
+        if (s.kind != "rename") continue;
+        const bool wasSynced = synced.erase(s.from) > 0 || fromUntouched;
+        if (wasSynced) synced.insert(s.path);
+        if (s.path.compare(0, volatilePrefix.size(), volatilePrefix) == 0) continue;
+        std::string what = s.from + " -> " + s.path;
+        if (s.from.empty()) {
+            faults.push_back("rename without its source: " + s.path);
+            continue;
         }
-        if (!sourceSynced) faults.push_back("moved without syncing it after its last change: " + what);
-        std::set<std::string> parents = {parentPath(r.from), parentPath(r.path)};
+        if (!wasSynced) faults.push_back("moved without syncing it after its last change: " + what);
+        std::set<std::string> parents = {parentPath(s.from), parentPath(s.path)};
         for (size_t j = i + 1; j < steps.size() && steps[j].kind != "rename"; j++)
             if (steps[j].kind == "fsync") parents.erase(steps[j].path);
         for (const std::string& p : parents) faults.push_back("directory " + p + " not synced after " + what);

@@ -20,10 +20,10 @@ struct TraceStep {
 
 std::vector<TraceStep> readTrace(const std::string& file);
 
-// Every rename outside the volatile run/ directory of `root` must have its source
-// synced since the previous rename (an fsync of it, or the write that made it) and be
-// followed, before the next rename, by an fsync of the directory it left and of the
-// one it entered. Returns one line per fault.
+// Every rename outside the volatile run/ directory of `root` must move an item synced
+// after its last change (an fsync of it, the write that made it, or a synced item
+// renamed to its name) and be followed, before the next rename, by an fsync of the
+// directory it left and of the one it entered. Returns one line per fault.
 std::vector<std::string> auditRenames(const std::vector<TraceStep>& steps, const std::string& root);
 
 extern const char* const kIdentifier;

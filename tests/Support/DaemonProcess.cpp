@@ -107,7 +107,7 @@ std::string DaemonProcess::at(const std::string& relative) const { return joinPa
 
 std::string DaemonProcess::socketPath() const { return at("run/vesseld/com.tarrow.vesseld"); }
 
-bool DaemonProcess::start(const std::vector<std::string>& extraEnvironment) {
+bool DaemonProcess::start(const std::vector<std::string>& extraEnvironment, const std::function<bool()>& ready) {
     std::vector<std::string> argv = {vesseldPath(), "--root", root_, "--init"};
     std::vector<std::string> env = environmentWith(extraEnvironment);
     auto cargv = cStrings(argv);
@@ -129,16 +129,18 @@ bool DaemonProcess::start(const std::vector<std::string>& extraEnvironment) {
     // Generous: a loaded two-core machine can take many seconds to start a process.
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(60);
     while (std::chrono::steady_clock::now() < deadline) {
+        // Before the reaping check: a caller that waits for nothing reaps the exit itself.
+        if (ready && ready()) return true;
         int status = 0;
         if (::waitpid(pid_, &status, WNOHANG) == pid_) {
             pid_ = -1;
             return false;
         }
-        if (auto c = client::VSLConnection::connect(socketPath(), nullptr)) {
+        if (auto c = ready ? nullptr : client::VSLConnection::connect(socketPath(), nullptr)) {
             auto r = c->sendRequest(dict({{"Command", Value::uint64(27)}}), std::chrono::seconds(10));
             if (r.ok()) return true;
         }
-        std::this_thread::sleep_for(std::chrono::milliseconds(25));
+        std::this_thread::sleep_for(std::chrono::milliseconds(ready ? 2 : 25));
     }
     return false;
 }
@@ -160,6 +162,20 @@ void DaemonProcess::kill() {
     while (::waitpid(pid_, &status, 0) < 0 && errno == EINTR) {
     }
     pid_ = -1;
+}
+
+int DaemonProcess::waitForExit(std::chrono::milliseconds timeout) {
+    if (pid_ <= 0) return -1;
+    const auto deadline = std::chrono::steady_clock::now() + timeout;
+    for (;;) {
+        int status = 0;
+        if (::waitpid(pid_, &status, WNOHANG) == pid_) {
+            pid_ = -1;
+            return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
+        }
+        if (std::chrono::steady_clock::now() >= deadline) return -1;
+        std::this_thread::sleep_for(std::chrono::milliseconds(2));
+    }
 }
 
 std::string DaemonProcess::addClient(const std::string& name, const std::string& signingIdentifier,

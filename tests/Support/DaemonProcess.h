@@ -5,6 +5,8 @@
 
 #include <sys/types.h>
 
+#include <chrono>
+#include <functional>
 #include <string>
 #include <vector>
 
@@ -28,14 +30,18 @@ public:
     std::string at(const std::string& relative) const;
     std::string socketPath() const;
 
-    // Starts vesseld --root ROOT --init and waits until it answers. False on failure.
-    bool start(const std::vector<std::string>& extraEnvironment = {});
+    // Starts vesseld --root ROOT --init and waits until it answers, or, given `ready`,
+    // until that holds (so that no request reaches the daemon). False on failure.
+    bool start(const std::vector<std::string>& extraEnvironment = {}, const std::function<bool()>& ready = {});
     // Soft and hard RLIMIT_NOFILE of the daemons started from now on (0: inherited).
     void setDescriptorLimit(unsigned long limit) { descriptorLimit_ = limit; }
     // SIGTERM and wait; returns the exit status (or -1).
     int stop();
     // SIGKILL and reap.
     void kill();
+    // Reaps the daemon once it has exited by itself: its exit status (128 + signal when
+    // killed), or -1 when it still runs after `timeout`.
+    int waitForExit(std::chrono::milliseconds timeout);
     pid_t pid() const { return pid_; }
     bool running() const { return pid_ > 0; }
 

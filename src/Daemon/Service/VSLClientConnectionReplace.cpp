@@ -176,6 +176,17 @@ bool replaceSteps(VSLClientConnection& connection, const VSLContainerIdentityRef
         }
     }
 
+    // The new container takes the old UUID before it moves: once it is at the
+    // destination the replacement counts as done, and a crash must not leave it there
+    // answering to its own UUID.
+    if (preserveOldUUID) {
+        auto renamed = fresh->mutableCopy();
+        renamed->setUuid(old->uuid());
+        if (!renamed->writeMetadataToDiskWithError(&underlying)) {
+            *error = underlying;
+            return false;
+        }
+    }
     if (!ops.moveItem(fresh->url(), run.destination, &underlying)) {
         *error = createVSLError(kReplaceFn, __LINE__, kVSLErrorReplaceFailed, underlying, true,
                                 "Failed to replace: %@ with: %@ at: %@", old ? old->url() : std::string("(null)"),
@@ -194,14 +205,7 @@ bool replaceSteps(VSLClientConnection& connection, const VSLContainerIdentityRef
     record->setUrl(run.destination);
     record->setTransient(transient);
     record->setExisted(true);
-    if (preserveOldUUID) {
-        record->setUuid(old->uuid());
-        // On disk too, or the next start would find the new container's own UUID.
-        if (!record->writeMetadataToDiskWithError(&underlying)) {
-            *error = underlying;
-            record->setUuid(fresh->uuid());
-        }
-    }
+    if (preserveOldUUID) record->setUuid(old->uuid());
     if (!cache->addContainerMetadata(record, run.destination, transient, true, &underlying)) {
         *error = createVSLError(kReplaceFn, __LINE__, kVSLErrorCacheAdd, underlying, true,
                                 "Failed to add to cache: %@, url: %@, transient: %d", run.destination,

@@ -1,6 +1,7 @@
 #include "Daemon/Service/VSLService.h"
 
 #include "Daemon/Service/VSLProcessIPCEvent.h"
+#include "Platform/DurableIO.h"
 #include "Platform/ServiceManager.h"
 
 #ifdef VESSEL_KILLPOINTS
@@ -52,6 +53,7 @@ std::unique_ptr<VSLService> VSLService::start(const std::shared_ptr<WorkQueue>& 
 #ifdef VESSEL_KILLPOINTS
         delayForTests(message.body);
 #endif
+        durable::beginScope(durable::Scope::ClientMessages);
         VSLPeerCredentials credentials;
         credentials.pid = peer->pid();
         credentials.uid = peer->uid();

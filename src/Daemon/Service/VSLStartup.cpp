@@ -19,6 +19,7 @@
 #include "Daemon/Upcall/VSLUpcallServer.h"
 #include "Platform/CrashAnnotation.h"
 #include "Platform/DeviceFacts.h"
+#include "Platform/DurableIO.h"
 #include "Platform/Log.h"
 #include "Platform/NamedSemaphore.h"
 #include "Platform/Notification.h"
@@ -64,6 +65,13 @@ void prepareForClients() {
     // Before any table is written: a kill during a rewrite leaves its temporary file.
     if (int rc = SandboxState::removeTemporaryFiles())
         LogWrite(kLogLevelError, kInit, "Failed to remove temporary sandbox files: %d", rc);
+    // An atomic rewrite that a kill stopped before its rename leaves a temporary file no
+    // listing sees: journals, pending updates and status files are whole or absent.
+    const auto configuration = VSLGlobalConfiguration::sharedInstance();
+    for (const std::string& directory : {configuration->replaceDirectory(), configuration->pendingUpdatesDirectory(),
+                                         configuration->libraryDirectory()})
+        if (int rc = durable::removeTemporaryFiles(directory))
+            LogWrite(kLogLevelError, kInit, "Failed to remove temporary files in %s: %d", directory, rc);
 }
 
 }  // namespace
@@ -92,6 +100,7 @@ void set_first_boot_work_completed() {
 }
 
 void vesseld_init(std::shared_ptr<Transaction> transaction) {
+    durable::beginScope(durable::Scope::Startup);
     SignpostInterval interval(LogCategory::Ipc, "StartingUp", "");
     openRotatingLog();
 
