@@ -38,8 +38,9 @@ void writeAll(const std::string& path, const void* data, size_t size) {
 
 World& world() {
     static World w = [] {
-        char templ[] = "/tmp/vessel-metadata-fuzz-XXXXXX";
-        if (!::mkdtemp(templ)) std::abort();
+        const char* tmp = std::getenv("TMPDIR");
+        std::string templ = std::string(tmp && *tmp ? tmp : "/tmp") + "/vessel-metadata-fuzz-XXXXXX";
+        if (!::mkdtemp(templ.data())) std::abort();
         std::string root = templ;
         static const std::string removeAtExit = root;
         std::atexit([] {

@@ -115,6 +115,31 @@ CodeSigningInfo infoFromRecord(const CodeSigningRecord& r) {
 
 }  // namespace
 
+std::vector<CodeSigningRecord> parsePolicyFile(const std::string& bytes, const std::string& file) {
+    std::string why;
+    auto root = decodePropertyList(bytes.data(), bytes.size(), &why);
+    if (!root) {
+        logSkip(file, why);
+        return {};
+    }
+    std::vector<Value> items;
+    if (const Array* a = root->arrayValue()) {
+        items = *a;
+    } else {
+        items.push_back(*root);
+    }
+    std::vector<CodeSigningRecord> records;
+    for (const Value& item : items) {
+        auto record = parseRecord(item, file, &why);
+        if (!record) {
+            logSkip(file, why);
+            continue;
+        }
+        records.push_back(std::move(*record));
+    }
+    return records;
+}
+
 struct CodeSigningPolicy::State {
     bool loaded = false;
     uint64_t watchToken = 0;
@@ -189,29 +214,13 @@ void CodeSigningPolicy::loadLocked() {
             logSkip(file, why);
             continue;
         }
-        auto root = decodePropertyList(bytes->data(), bytes->size(), &why);
-        if (!root) {
-            logSkip(file, why);
-            continue;
-        }
-        std::vector<Value> items;
-        if (const Array* a = root->arrayValue()) {
-            items = *a;
-        } else {
-            items.push_back(*root);
-        }
-        for (const Value& item : items) {
-            auto record = parseRecord(item, file, &why);
-            if (!record) {
-                logSkip(file, why);
+        for (CodeSigningRecord& record : parsePolicyFile(*bytes, file)) {
+            if (s.byExecutable.count(record.executable)) {
+                logSkip(file, "a record for " + record.executable + " came first");
                 continue;
             }
-            if (s.byExecutable.count(record->executable)) {
-                logSkip(file, "a record for " + record->executable + " came first");
-                continue;
-            }
-            s.order.push_back(record->executable);
-            s.byExecutable.emplace(record->executable, std::move(*record));
+            s.order.push_back(record.executable);
+            s.byExecutable.emplace(record.executable, std::move(record));
         }
     }
     ::close(dirFd);

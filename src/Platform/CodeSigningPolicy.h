@@ -46,6 +46,10 @@ struct CodeSigningInfo {
     std::string error;       // why there is no signing identifier
 };
 
+// The well-formed records of one policy file's contents, in file order; what is skipped
+// is logged. `file` only names the source.
+std::vector<CodeSigningRecord> parsePolicyFile(const std::string& bytes, const std::string& file);
+
 class CodeSigningPolicy {
 public:
     // directory is a host path; it need not exist yet.

@@ -150,6 +150,12 @@ std::optional<Value> fromPlist(plist_t p, int depth, std::string* error) {
         case PLIST_DATE: {
             int32_t sec = 0, usec = 0;
             plist_get_date_val(p, &sec, &usec);
+            // The library's conversion of a date beyond 32-bit seconds yields these; such a
+            // date could never be written back.
+            if (sec == std::numeric_limits<int32_t>::min() || usec <= -1000000 || usec >= 1000000) {
+                if (error) *error = "date out of range for a property list";
+                return std::nullopt;
+            }
             return Value::date(Date{(static_cast<int64_t>(sec) + kPlistEpochOffset) * 1000000000 +
                                     static_cast<int64_t>(usec) * 1000});
         }

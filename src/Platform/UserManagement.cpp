@@ -57,8 +57,8 @@ bool parsePersona(const Value& entry, const std::string& rootPrefix, PersonaAttr
     auto number = [&](const char* key, bool required, std::optional<uint64_t>* n) {
         const Value* v = entry.find(key);
         if (!v) return required ? fail(std::string("missing ") + key) : true;
-        if (!v->isNumber()) return fail(std::string(key) + " is not a number");
-        *n = v->unsignedNumber();
+        *n = v->isNumber() ? v->unsignedNumber() : std::nullopt;
+        if (!*n) return fail(std::string(key) + " is not a whole number in range");
         return true;
     };
     auto flag = [&](const char* key, bool* b) {

@@ -126,7 +126,8 @@ std::optional<uint64_t> Value::unsignedNumber() const {
     if (auto u = uint64Value()) return u;
     if (auto i = int64Value()) return static_cast<uint64_t>(*i);
     if (auto d = doubleValue()) {
-        if (!std::isfinite(*d)) return std::nullopt;
+        // Whatever no 64-bit integer holds is no number at all (converting it is undefined).
+        if (!(*d >= -0x1p63 && *d < 0x1p64)) return std::nullopt;
         return *d < 0 ? static_cast<uint64_t>(static_cast<int64_t>(*d)) : static_cast<uint64_t>(*d);
     }
     return std::nullopt;

@@ -1,4 +1,6 @@
 #include <gtest/gtest.h>
+
+#include <cmath>
 #include <unistd.h>
 
 #include "Identity/PersonaTestSupport.h"
@@ -92,6 +94,10 @@ TEST(UserManagement, UnreadableOrMalformedFilesKeepTheLastGoodList) {
         {"universal enterprise", plistBytes(entry({{"Universal", Value::boolean(true)}}))},
         {"bundle list of numbers", plistBytes(entry({{"BundleIdentifiers", Value::array({Value::uint64(1)})}}))},
         {"home not a string", plistBytes(entry({{"HomeDirectory", Value::boolean(true)}}))},
+        // Numbers no 64-bit integer holds are no numbers (the first was found by fuzzing).
+        {"type -1e111", readFile(std::string(VESSEL_SOURCE_DIR) + "/fuzz/regressions/personas/number-beyond-int64")},
+        {"persona ID 1e300", plistBytes(entry({{"KernelPersonaID", Value::real(1e300)}}))},
+        {"uid NaN", plistBytes(entry({{"UID", Value::real(std::nan(""))}}))},
     };
     for (const auto& [why, bytes] : bad) {
         root.writeFile("etc/vesseld/personas.plist", bytes);

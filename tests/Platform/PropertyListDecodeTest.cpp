@@ -35,3 +35,22 @@ TEST(PropertyListDecode, RefusesNulsAndBrokenTextInsteadOfAborting) {
     for (size_t cut = 0; cut < bytes->size(); cut += 7)
         decodePropertyList(bytes->data(), cut, nullptr);  // never aborts
 }
+
+// A date beyond 32-bit seconds, in a file found by fuzzing: refused, since it could not
+// be written back; a date that reads writes back.
+TEST(PropertyListDecode, DatesBeyondWhatCanBeWrittenAreRefused) {
+    std::ifstream in(std::string(VESSEL_SOURCE_DIR) + "/fuzz/regressions/policy_store/date-beyond-int32-seconds",
+                     std::ios::binary);
+    std::string file(std::istreambuf_iterator<char>(in), {});
+    ASSERT_FALSE(file.empty());
+    std::string why;
+    EXPECT_FALSE(decodePropertyList(file.data(), file.size(), &why));
+    EXPECT_EQ("date out of range for a property list", why);
+
+    Value early = dict({{"d", Value::date(Date{-123456789123456789})}});
+    auto bytes = encodeBinaryPropertyList(early, nullptr);
+    ASSERT_TRUE(bytes);
+    auto read = decodePropertyList(bytes->data(), bytes->size(), nullptr);
+    ASSERT_TRUE(read);
+    EXPECT_TRUE(encodeBinaryPropertyList(*read, nullptr));
+}

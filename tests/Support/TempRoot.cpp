@@ -1,6 +1,5 @@
 #include "Support/TempRoot.h"
 
-#include <ftw.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -12,21 +11,61 @@
 #include "Platform/DeviceFacts.h"
 #include "Platform/PropertyList.h"
 #include "Platform/SystemRoot.h"
+#include "Platform/TreeRemove.h"
 
 namespace vsl::test {
 
+namespace {
+
+const char* const kScratchVariable = "VESSEL_TEST_SCRATCH";
+
+// Every temporary directory a test process makes lies in one scratch directory of that
+// process, which the process that made it removes when it exits. Its children (death
+// tests, which may die without running any destructor, and daemons) inherit it and
+// make theirs inside, so nothing they leave outlives the test either.
+class Scratch {
+public:
+    Scratch() {
+        if (const char* inherited = std::getenv(kScratchVariable); inherited && *inherited) {
+            path_ = inherited;
+            return;
+        }
+        const char* tmp = std::getenv("TMPDIR");
+        std::string templ = std::string(tmp && *tmp ? tmp : "/tmp") + "/vessel-test-XXXXXX";
+        if (!mkdtemp(templ.data())) throw std::runtime_error("mkdtemp failed");
+        path_ = templ;
+        owner_ = ::getpid();
+        ::setenv(kScratchVariable, path_.c_str(), 1);
+    }
+    ~Scratch() {
+        // A forked child that exits normally runs this too; only the maker removes.
+        if (owner_ == ::getpid()) removeTree(path_);
+    }
+    const std::string& path() const { return path_; }
+
+private:
+    std::string path_;
+    pid_t owner_ = 0;
+};
+
+// Made before main, so a forked death-test child never makes one of its own.
+const Scratch& scratch() {
+    static Scratch s;
+    return s;
+}
+[[maybe_unused]] const Scratch& madeAtStart = scratch();
+
+}  // namespace
+
 std::string makeTempDir(const std::string& prefix) {
-    std::string templ = (std::getenv("TMPDIR") ? std::string(std::getenv("TMPDIR")) : std::string("/tmp")) +
-                        "/" + prefix + "XXXXXX";
+    std::string templ = scratch().path() + "/" + prefix + "XXXXXX";
     if (!mkdtemp(templ.data())) throw std::runtime_error("mkdtemp failed");
     return templ;
 }
 
 void removeTree(const std::string& path) {
-    nftw(
-        path.c_str(),
-        [](const char* p, const struct stat*, int, struct FTW*) { return ::remove(p) == 0 ? 0 : 0; }, 64,
-        FTW_DEPTH | FTW_PHYS);
+    // Descriptor-relative, so trees deeper than PATH_MAX go too.
+    vsl::removeTree(path, [](const RemoveFailure&) {});
 }
 
 std::string readFile(const std::string& path) {
@@ -34,7 +73,7 @@ std::string readFile(const std::string& path) {
     return std::string(std::istreambuf_iterator<char>(in), {});
 }
 
-TempRoot::TempRoot(uid_t mobileUID, gid_t mobileGID) : path_(makeTempDir("vessel-root-")) {
+TempRoot::TempRoot(uid_t mobileUID, gid_t mobileGID) : path_(makeTempDir("vessel-root-")), owner_(::getpid()) {
     std::string home = "/private/var/mobile";
     writeFile("etc/passwd", "root:x:0:0:root:/private/var/root:/bin/sh\nmobile:x:" + std::to_string(mobileUID) +
                                 ":" + std::to_string(mobileGID) + "::" + home + ":/bin/sh\n");
@@ -45,6 +84,8 @@ TempRoot::TempRoot(uid_t mobileUID, gid_t mobileGID) : path_(makeTempDir("vessel
 }
 
 TempRoot::~TempRoot() {
+    // A forked child that exits normally must not take its parent's root away.
+    if (owner_ != ::getpid()) return;
     removeTree(path_);
     setSystemRoot("/");
     reloadDeviceFacts();

@@ -26,9 +26,12 @@ public:
 
 private:
     std::string path_;
+    pid_t owner_;
 };
 
 std::string readFile(const std::string& path);
+// A new directory inside this test process's scratch directory, which goes when the
+// process that made it exits (see TempRoot.cpp); removeTree may take it earlier.
 std::string makeTempDir(const std::string& prefix);
 void removeTree(const std::string& path);
 
