@@ -70,7 +70,8 @@ std::string lastPathComponent(std::string_view path) {
 }
 
 bool isPlainPathComponent(std::string_view name) {
-    return !name.empty() && name != "." && name != ".." && name.find('/') == std::string_view::npos &&
+    return !name.empty() && name.size() <= NAME_MAX && name != "." && name != ".." &&
+           name.find('/') == std::string_view::npos &&
            name.find('\0') == std::string_view::npos;
 }
 

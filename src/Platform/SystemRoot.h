@@ -23,7 +23,8 @@ std::string unrootedPath(std::string_view hostPath);
 std::string joinPath(std::string_view dir, std::string_view name);
 std::string parentPath(std::string_view path);
 std::string lastPathComponent(std::string_view path);
-// One plain name component: not empty, ".", "..", and without "/" or NUL.
+// One plain name component: not empty, ".", "..", nor longer than a file name may
+// be, and without "/" or NUL.
 bool isPlainPathComponent(std::string_view name);
 
 }  // namespace vsl

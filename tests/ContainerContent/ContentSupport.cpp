@@ -1,10 +1,8 @@
 #include "ContainerContent/ContentSupport.h"
 
 #include <fcntl.h>
-#include <ftw.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
-#include <sys/xattr.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -83,49 +81,6 @@ bool waitForLog(const DaemonProcess& daemon, const std::string& text, size_t cou
         std::this_thread::sleep_for(std::chrono::milliseconds(10));
     }
     return false;
-}
-
-namespace {
-
-std::string nodeState(const std::string& path, const struct stat& st, bool full) {
-    std::string s = std::to_string(st.st_mode) + " " + std::to_string(st.st_uid) + ":" + std::to_string(st.st_gid);
-    if (S_ISLNK(st.st_mode)) {
-        char target[PATH_MAX];
-        ssize_t n = ::readlink(path.c_str(), target, sizeof target);
-        s += " -> " + std::string(target, n > 0 ? static_cast<size_t>(n) : 0);
-    }
-    if (!full) return s;
-    s += " ino " + std::to_string(st.st_ino) + " ctime " + std::to_string(st.st_ctim.tv_sec) + "." +
-         std::to_string(st.st_ctim.tv_nsec);
-    char names[4096];
-    ssize_t length = ::llistxattr(path.c_str(), names, sizeof names);
-    for (ssize_t at = 0; at < length; at += static_cast<ssize_t>(std::strlen(names + at)) + 1) {
-        char value[4096];
-        ssize_t n = ::lgetxattr(path.c_str(), names + at, value, sizeof value);
-        s += " " + std::string(names + at) + "=" + std::string(value, n > 0 ? static_cast<size_t>(n) : 0);
-    }
-    if (S_ISREG(st.st_mode)) s += " [" + readFile(path) + "]";
-    return s;
-}
-
-}  // namespace
-
-std::map<std::string, std::string> treeState(const std::string& directory, bool full) {
-    static thread_local std::map<std::string, std::string>* out;
-    static thread_local const std::string* top;
-    static thread_local bool fullState;
-    std::map<std::string, std::string> result;
-    out = &result;
-    top = &directory;
-    fullState = full;
-    ::nftw(directory.c_str(),
-           [](const char* path, const struct stat* st, int, struct FTW*) {
-               std::string relative = std::string(path).substr(top->size());
-               (*out)[relative.empty() ? "." : relative] = nodeState(path, *st, fullState);
-               return 0;
-           },
-           16, FTW_PHYS);
-    return result;
 }
 
 }  // namespace vsl::test

@@ -10,6 +10,7 @@
 #include "Client/VSLContainerInfo.h"
 #include "Support/DaemonProcess.h"
 #include "Support/RootFiles.h"
+#include "Support/TreeSnapshot.h"
 
 namespace vsl::test {
 
@@ -31,11 +32,6 @@ Created createContainer(client::VSLConnection& connection, const std::string& id
 uint64_t send(client::VSLConnection& connection, Dictionary request, Value* reply = nullptr);
 std::string logText(const DaemonProcess& daemon);
 
-// Every node below `directory` (and the directory itself, as "."), by relative path,
-// without following links: type, mode, owner and link target; with `full` also the
-// inode, change time, extended attributes (ACLs) and file contents, so that anything
-// moved, removed, re-owned or rewritten shows.
-std::map<std::string, std::string> treeState(const std::string& directory, bool full = true);
 // Waits (bounded) until the daemon's log holds `text` at least `count` times.
 bool waitForLog(const DaemonProcess& daemon, const std::string& text, size_t count = 1);
 

@@ -50,9 +50,10 @@ void VSLDataProtectionManager::setDataProtectionOnDataContainerForContainerIdent
     auto complete = [&completion](uint64_t code) {
         if (completion) completion(code);
     };
-    // The identifier names the pending-update file: one plain name component only.
+    // The identifier names the pending-update file: that name must be one plain name
+    // component, short enough to be a file name.
     if (!identity || !isPerUserContainerClass(identity->containerClass()) ||
-        !isPlainPathComponent(identity->identifier())) {
+        !VSLDataProtectionChangeOperation::urlForProtectionOperationWithContainerIdentity(*identity)) {
         VSL_ERROR(kVSLErrorInvalidObject, nullptr, true, "Can't act on an invalid object: identity: %@", identity);
         return complete(kVSLErrorInvalidObject);
     }

@@ -26,7 +26,9 @@ bool VSLContainerIdentity::initWithUserIdentity(const VSLUserIdentityRef& userId
         LogWrite(kLogLevelError, kInitName, "Invalid object: missing identifier");
         return fail(code, kVSLErrorMissingIdentifier);
     }
-    if (!identifier.stringValue()) {
+    // An empty name is no name: refused here, before a creation could leave a
+    // container on disk that the cache then refuses.
+    if (!identifier.stringValue() || identifier.stringValue()->empty()) {
         LogWrite(kLogLevelError, kInitName, "Invalid object: identifier = [%@]", identifier);
         return fail(code, kVSLErrorInvalidObject);
     }
