@@ -32,7 +32,6 @@ namespace {
 const char* const kAllowed = "com.tarrow.private.Vesselry.allowed";
 const char* const kLog = "private/var/root/Library/Logs/Vesselry/vesseld.log";
 const char* const kSystemData = "private/var/containers/Data/System";
-const char* const kSystemGroup = "private/var/containers/Shared/SystemGroup";
 const char* const kUserData = "private/var/mobile/Containers/Data/Application";
 
 // A property-list dictionary of these XML entries.
