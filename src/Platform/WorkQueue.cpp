@@ -14,9 +14,14 @@ namespace {
 
 using Clock = std::chrono::steady_clock;
 
-// Beyond this many workers, a new one is started only after work has waited this long
-// with every worker busy.
+// Beyond the eager workers, a new one is started only after work has waited this long
+// with every worker busy and none of them finishing anything (they may all be blocked
+// on that work)...
 constexpr auto kSpawnDelay = std::chrono::milliseconds(3);
+// ...or, while they keep finishing items (starved of CPU, not blocked: more threads would
+// only add churn), at most one per this interval, so that low-priority work passed over
+// by a steady stream of higher-priority work still gets a thread.
+constexpr auto kStarvedSpawnDelay = std::chrono::milliseconds(50);
 constexpr size_t kMaxWorkers = 512;
 // A serial queue runs this many items per turn before yielding its worker.
 constexpr unsigned kSerialBatch = 16;
@@ -128,6 +133,7 @@ private:
                 entry.queue->drain();
                 entry.queue.reset();  // may destroy the queue: not under the pool lock
                 lock.lock();
+                ++finished_;
                 continue;
             }
             Idler me;
@@ -151,9 +157,11 @@ private:
     }
 
     // Starts a worker whenever the oldest waiting entry has waited kSpawnDelay while no
-    // worker was idle: the busy ones may all be blocked on that very entry.
+    // worker was idle or finished an entry: the busy ones may all be blocked on it.
     void monitor() {
         std::unique_lock lock(mutex_);
+        size_t finishedBefore = finished_;
+        auto lastSpawn = Clock::now() - kStarvedSpawnDelay;
         for (;;) {
             if (!hasWorkLocked()) {
                 monitorWaiting_ = true;
@@ -165,8 +173,12 @@ private:
             for (const auto& ready : ready_) {
                 if (!ready.empty()) oldest = std::min(oldest, ready.front().since);
             }
-            if (idle_.empty() && Clock::now() - oldest >= kSpawnDelay && workers_ < kMaxWorkers) {
-                spawnLocked();
+            const auto now = Clock::now();
+            const bool stalled = finished_ == finishedBefore;
+            finishedBefore = finished_;
+            if (idle_.empty() && workers_ < kMaxWorkers && now - oldest >= kSpawnDelay &&
+                (stalled || now - lastSpawn >= kStarvedSpawnDelay) && spawnLocked()) {
+                lastSpawn = now;
             }
             monitorCv_.wait_for(lock, kSpawnDelay);
         }
@@ -176,6 +188,7 @@ private:
     std::deque<Entry> ready_[3];  // by QueuePriority
     std::vector<Idler*> idle_;
     size_t workers_ = 0;
+    size_t finished_ = 0;  // entries drained, so the monitor can tell blocked from starved
     const size_t eagerWorkers_;  // started without delay, one per core
     std::chrono::milliseconds idleTimeout_{5000};
     std::condition_variable monitorCv_;

@@ -318,6 +318,36 @@ TEST(WorkQueueTest, IdleWorkersExitAndIdleQueuesCostNoThreads) {
     WorkQueue::setPoolIdleTimeout(5000ms);
 }
 
+// Workers that are busy but keep finishing items are short of CPU, not blocked: the pool
+// must not start a thread every few milliseconds for them (each one costs a stack and a
+// start and an exit later), while a blocked pool still grows (test above).
+TEST(WorkQueueTest, BusyWorkersThatKeepFinishingDoNotGrowThePool) {
+    WorkQueue::setPoolIdleTimeout(50ms);
+    ASSERT_TRUE(eventually([] { return WorkQueue::poolWorkerCount() == 0; }));
+    WorkQueue::setPoolIdleTimeout(5000ms);
+    auto queue = WorkQueue::concurrent("test.starved");
+    auto group = WorkGroup::create();
+    std::atomic<size_t> peak{0};
+    const auto start = std::chrono::steady_clock::now();
+    for (int i = 0; i < 2000; ++i) {
+        group->async(queue, [&] {
+            const auto until = std::chrono::steady_clock::now() + 300us;
+            while (std::chrono::steady_clock::now() < until) {
+            }
+            size_t seen = peak.load();
+            const size_t now = WorkQueue::poolWorkerCount();
+            while (now > seen && !peak.compare_exchange_weak(seen, now)) {
+            }
+        });
+    }
+    ASSERT_TRUE(group->wait(kPatience));
+    const auto elapsed = std::chrono::steady_clock::now() - start;
+    // A thread for every few milliseconds of backlog would reach well past this.
+    const size_t bound = 6 + static_cast<size_t>(elapsed / 25ms);
+    EXPECT_LE(peak.load(), bound)
+        << "over " << std::chrono::duration_cast<std::chrono::milliseconds>(elapsed).count() << " ms";
+}
+
 TEST(WorkQueueTest, QueueLivesUntilItsItemsHaveRun) {
     std::weak_ptr<WorkQueue> weak;
     Gate release;
