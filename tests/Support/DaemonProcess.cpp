@@ -95,11 +95,13 @@ int runProgram(const std::vector<std::string>& argvIn, std::string* out, std::st
     return WIFEXITED(status) ? WEXITSTATUS(status) : 128 + WTERMSIG(status);
 }
 
-DaemonProcess::DaemonProcess() : root_(makeTempDir("vessel-e2e-")) {}
+// The marker's name is taken now: a static instance is destroyed at exit, after the
+// digest library has torn itself down.
+DaemonProcess::DaemonProcess() : root_(makeTempDir("vessel-e2e-")), marker_(firstBootMarkerName(*this)) {}
 
 DaemonProcess::~DaemonProcess() {
     if (running()) kill();
-    removeSemaphore(firstBootMarkerName(*this));
+    removeSemaphore(marker_);
     removeTree(root_);
 }
 

@@ -73,6 +73,7 @@ public:
 
 private:
     std::string root_;
+    std::string marker_;  // the root's first-boot marker
     pid_t pid_ = -1;
     unsigned long descriptorLimit_ = 0;
 };
