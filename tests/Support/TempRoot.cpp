@@ -33,6 +33,8 @@ public:
         const char* tmp = std::getenv("TMPDIR");
         std::string templ = std::string(tmp && *tmp ? tmp : "/tmp") + "/vessel-test-XXXXXX";
         if (!mkdtemp(templ.data())) throw std::runtime_error("mkdtemp failed");
+        // Tests that act as other users reach their roots through it.
+        ::chmod(templ.c_str(), 0755);
         path_ = templ;
         owner_ = ::getpid();
         ::setenv(kScratchVariable, path_.c_str(), 1);
