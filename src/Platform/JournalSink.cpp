@@ -56,13 +56,15 @@ void appendField(std::string& entry, std::string_view name, std::string_view val
 }
 
 // One socket for the process; datagrams are sent whole, whichever thread sends them.
+// Never waits: a journal that has fallen behind loses lines (the rotating log keeps
+// them) rather than stalling the thread that logs, which may be serving a client.
 int journalSocket() {
     static const int fd = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
     return fd;
 }
 
 bool sendDatagram(const std::string& entry, const sockaddr_un& addr) {
-    const ssize_t n = ::sendto(journalSocket(), entry.data(), entry.size(), MSG_NOSIGNAL,
+    const ssize_t n = ::sendto(journalSocket(), entry.data(), entry.size(), MSG_NOSIGNAL | MSG_DONTWAIT,
                                reinterpret_cast<const sockaddr*>(&addr), sizeof addr);
     return n == static_cast<ssize_t>(entry.size());
 }
@@ -91,7 +93,7 @@ bool sendInMemoryFile(const std::string& entry, const sockaddr_un& addr) {
     header->cmsg_len = CMSG_LEN(sizeof(int));
     const int fd = file.get();
     std::memcpy(CMSG_DATA(header), &fd, sizeof fd);
-    return ::sendmsg(journalSocket(), &message, MSG_NOSIGNAL) >= 0;
+    return ::sendmsg(journalSocket(), &message, MSG_NOSIGNAL | MSG_DONTWAIT) >= 0;
 }
 
 }  // namespace

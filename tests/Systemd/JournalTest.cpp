@@ -12,6 +12,7 @@
 
 #include "Daemon/Core/VSLErrorCodes.h"
 #include "Platform/Value.h"
+#include "Support/Boot.h"
 #include "Support/DaemonProcess.h"
 #include "Support/TempRoot.h"
 #include "Systemd/DatagramListener.h"
@@ -85,6 +86,10 @@ TEST(JournalTest, FailedCreateReachesTheJournalWithItsFieldsAndTheRotatingLogWit
     ASSERT_TRUE(journal.bound());
     ASSERT_TRUE(daemon.start({"VESSELD_TEST_JOURNAL_SOCKET=" + socket, "VESSELD_TEST_FAIL_CREATE=com.example.broken"}))
         << readFile(daemon.at("vesseld.stderr"));
+    // Start-up's lines are read now: the socket's queue is short, and a daemon finding
+    // it full drops lines rather than wait.
+    ASSERT_TRUE(waitForNotification(daemon, "com.tarrow.vesseld.reboot-cleanup-complete"));
+    journal.entries();
 
     auto made = daemon.run(vesselctlPath(), {"createOrLookup", "Identifier=com.example.broken", "ContainerClass=2",
                                              "CreateIfNecessary=true"});
