@@ -90,7 +90,7 @@ TEST_F(IpcServerTest, PairsRepliesWithRequestsWhenPipelinedAndAnsweredOutOfOrder
         if (m.body.find("Release")) {
             std::lock_guard lock(mutex);
             // Answered from another thread, after the request that released them.
-            for (auto& [p, h] : held) later->async([p, h] { p->sendReply(h.id, echoOf(h)); });
+            for (auto& [p, h] : held) later->async([p = p, h = h] { p->sendReply(h.id, echoOf(h)); });
             held.clear();
         }
         if (m.body.find("Later")) {
