@@ -146,17 +146,19 @@ void IpcEventLoop::threadMain() {
         // Whatever this event leads to may block; someone must keep listening. When no
         // thread can be added, the peer's work goes to its queue and this one stays.
         const bool handOff = idle_ == 0 && !spawnThreadLocked();
+        // A copy: epoll_event is packed, so its key may not be aligned for a reference.
+        const uint64_t key = ev.data.u64;
         std::shared_ptr<IpcPeer> peer;
-        if (ev.data.u64 != kListenerKey && ev.data.u64 != kWakeKey && ev.data.u64 != kTimerKey) {
-            auto it = peers_.find(ev.data.u64);
+        if (key != kListenerKey && key != kWakeKey && key != kTimerKey) {
+            auto it = peers_.find(key);
             if (it != peers_.end()) peer = it->second;
         }
         lock.unlock();
-        if (ev.data.u64 == kListenerKey) {
+        if (key == kListenerKey) {
             acceptAll();
             willBeIdle();
             armOneShot(epollFd_, listenFd_, kListenerKey, EPOLL_CTL_MOD);
-        } else if (ev.data.u64 == kTimerKey) {
+        } else if (key == kTimerKey) {
             uint64_t expirations = 0;
             [[maybe_unused]] ssize_t r = ::read(timerFd_, &expirations, sizeof expirations);
             closeIdlePeers();
