@@ -43,6 +43,13 @@ uint64_t watchNotification(const std::string& name, std::function<void()> change
         errno = EINVAL;
         return 0;
     }
+    // After a reboot nothing has posted yet and the directory is gone; a watch on a
+    // missing directory would never fire.
+    UniqueFd dir;
+    if (int rc = durable::makeDirectoryNoFollow(notificationDirectory(), 0755, true, dir.out())) {
+        errno = rc;
+        return 0;
+    }
     return FileWatcher::shared().watch(notificationDirectory(), name, std::move(changed));
 }
 
