@@ -48,6 +48,20 @@ bool someoneAnswers(const sockaddr_un& addr) {
     return answers;
 }
 
+// The lock beside a socket, held for as long as its process serves: -1 with errno set
+// when it cannot be opened, or EWOULDBLOCK when another process holds it.
+int takeServerLock(const std::string& lockPath) {
+    const int fd = ::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
+    if (fd < 0) return -1;
+    if (::flock(fd, LOCK_EX | LOCK_NB) != 0) {
+        const int err = errno;
+        ::close(fd);
+        errno = err;
+        return -1;
+    }
+    return fd;
+}
+
 }  // namespace
 
 std::string defaultIpcServicePath() { return rootedPath("run/vesseld/com.tarrow.vesseld"); }
@@ -60,14 +74,7 @@ std::unique_ptr<IpcServer> IpcServer::start(IpcServerOptions options, std::strin
         ::fcntl(fd, F_SETFD, FD_CLOEXEC);
         // The service manager owns the socket file; the lock still names the serving
         // process to whoever asks (vesselctl status reads its holder).
-        int lockFd = -1;
-        if (!options.path.empty()) {
-            lockFd = ::open((options.path + ".lock").c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-            if (lockFd >= 0 && ::flock(lockFd, LOCK_EX | LOCK_NB) != 0) {
-                ::close(lockFd);
-                lockFd = -1;
-            }
-        }
+        const int lockFd = options.path.empty() ? -1 : takeServerLock(options.path + ".lock");
         auto loop = std::make_shared<IpcEventLoop>(std::move(options), fd);
         if (!loop->start(error)) {
             if (lockFd >= 0) ::close(lockFd);
@@ -84,11 +91,11 @@ std::unique_ptr<IpcServer> IpcServer::start(IpcServerOptions options, std::strin
     // The lock decides between two servers starting at once; the probe below
     // still catches a server that does not take it.
     const std::string lockPath = path + ".lock";
-    const int lockFd = ::open(lockPath.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0644);
-    if (lockFd < 0) return failWith(error, "cannot open " + lockPath + ": " + std::strerror(errno));
-    if (::flock(lockFd, LOCK_EX | LOCK_NB) != 0) {
-        ::close(lockFd);
-        return failWith(error, "another server is running on " + path);
+    const int lockFd = takeServerLock(lockPath);
+    if (lockFd < 0) {
+        const int err = errno;
+        if (err == EWOULDBLOCK) return failWith(error, "another server is running on " + path);
+        return failWith(error, "cannot open " + lockPath + ": " + std::strerror(err));
     }
     auto giveUp = [&](std::string text) {
         ::close(lockFd);
