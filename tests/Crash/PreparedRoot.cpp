@@ -25,7 +25,7 @@ const char* const kStagedPrefix = "com.example.staged.";
 
 namespace {
 
-constexpr int kTreeDirectories = 12;
+constexpr int kTreeDirectories = 14;
 constexpr int kTreeFiles = 25;  // per directory
 
 std::string relativeTo(const std::string& root, const std::string& path) {

@@ -235,7 +235,7 @@ int classOf(const std::string& path) {
     return n <= 0 ? 0 : std::atoi(std::string(buf, static_cast<size_t>(n)).c_str());
 }
 
-bool locked(const DaemonProcess& d) { return readFile(d.at("run/vesseld/keybag/lockstate")) == "1"; }
+bool locked(const DaemonProcess& d) { return readFile(d.at("run/vesseld/keybag/lockstate")).starts_with("1"); }
 
 void keybag(const DaemonProcess& d, const char* verb) {
     std::string out, err;

@@ -67,10 +67,7 @@ TEST(CrashSweep, ReplaceWithOld) { sweep("ReplaceWithOld"); }
 TEST(CrashSweep, ReplaceWithoutOld) { sweep("ReplaceWithoutOld"); }
 TEST(CrashSweep, Wipe) { sweep("Wipe"); }
 TEST(CrashSweep, Protect) { sweep("Protect"); }
-// Off until its fault is fixed: killed at the pending-update directory's sync (N=3) and
-// rebooted while still locked, the restarted change parks and never sees the unlock
-// notification. Run it with --gtest_also_run_disabled_tests.
-TEST(CrashSweep, DISABLED_ProtectParkedWhileLocked) { sweep("ProtectParkedWhileLocked"); }
+TEST(CrashSweep, ProtectParkedWhileLocked) { sweep("ProtectParkedWhileLocked"); }
 TEST(CrashSweep, RecoveryKilled) { sweep("RecoveryKilled"); }
 
 // VESSEL_CRASH_LONG=ITERATIONS (scripts/test --crash-long); VESSEL_CRASH_SEED repeats a run.

@@ -1,0 +1,16 @@
+# Fails when one of FILES ("|"-separated objects or executables) holds the kill-point
+# step counter or the name of a variable that only test builds read.
+string(REPLACE "|" ";" files "${FILES}")
+set(found)
+foreach(file ${files})
+  file(STRINGS ${file} hits REGEX "VESSELD_(KILL_AT|KILL_SCOPE|DURABLE_TRACE|TEST_[A-Z_]+)|gSteps|gNumbered|stepCount|killConfig")
+  if(hits)
+    list(APPEND found "${file}: ${hits}")
+  endif()
+endforeach()
+list(LENGTH files count)
+if(found)
+  string(REPLACE ";" "\n" found "${found}")
+  message(FATAL_ERROR "test hooks in a build without them:\n${found}")
+endif()
+message(STATUS "${count} files searched: no step counter, no test-hook variable")
