@@ -4,6 +4,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <bit>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -70,6 +71,27 @@ World& world() {
     return w;
 }
 
+// Value equality, except that a NaN equals a NaN of the same bits.
+bool sameValue(const Value& a, const Value& b) {
+    if (a.type() != b.type()) return false;
+    if (auto x = a.doubleValue()) return std::bit_cast<uint64_t>(*x) == std::bit_cast<uint64_t>(*b.doubleValue());
+    if (const Array* x = a.arrayValue()) {
+        const Array& y = *b.arrayValue();
+        if (x->size() != y.size()) return false;
+        for (size_t i = 0; i < x->size(); i++)
+            if (!sameValue((*x)[i], y[i])) return false;
+        return true;
+    }
+    if (const Dictionary* x = a.dictionaryValue()) {
+        const Dictionary& y = *b.dictionaryValue();
+        if (x->size() != y.size()) return false;
+        for (auto i = x->begin(), j = y.begin(); i != x->end(); ++i, ++j)
+            if (i->first != j->first || !sameValue(i->second, j->second)) return false;
+        return true;
+    }
+    return a == b;
+}
+
 }  // namespace
 
 extern "C" int LLVMFuzzerInitialize(int*, char***) {
@@ -106,7 +128,7 @@ extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     REQUIRE(again->containerClass() == metadata->containerClass());
     REQUIRE(sameUserIdentity(again->userIdentity(), metadata->userIdentity()));
     REQUIRE(again->userManagedAssetsDirName() == metadata->userManagedAssetsDirName());
-    // Compared as bytes: a NaN in the info values is equal to nothing, itself included.
-    REQUIRE(encodeBinaryPropertyList(again->metadataDictionary(), nullptr) == bytes);
+    // Not compared as bytes: the writer shares equal objects only some of the time.
+    REQUIRE(sameValue(again->metadataDictionary(), metadata->metadataDictionary()));
     return 0;
 }
