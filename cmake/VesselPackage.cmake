@@ -83,7 +83,7 @@ set(CPACK_DEBIAN_DAEMON_PACKAGE_CONTROL_STRICT_PERMISSION ON)
 
 set(CPACK_DEBIAN_DEV_PACKAGE_NAME libvessel-dev)
 set(CPACK_DEBIAN_DEV_PACKAGE_SECTION libdevel)
-set(CPACK_DEBIAN_DEV_PACKAGE_DEPENDS "libplist-dev, libsystemd-dev, uuid-dev, libacl1-dev, libssl-dev")
+set(CPACK_DEBIAN_DEV_PACKAGE_DEPENDS "libplist-dev, uuid-dev, libacl1-dev")
 set(CPACK_COMPONENT_DEV_DESCRIPTION "client library of vesseld (development files)
  libvessel sends requests to vesseld and reads its replies; a static library with its
  headers and a pkg-config file (vessel).")

@@ -1,13 +1,13 @@
 #include "Platform/NamedSemaphore.h"
 
 #include <fcntl.h>
-#include <openssl/sha.h>
 #include <semaphore.h>
 #include <stdlib.h>
 
 #include <cerrno>
 #include <climits>
-#include <cstdio>
+
+#include "Platform/Sha256.h"
 
 namespace vsl {
 
@@ -15,11 +15,7 @@ std::string semaphoreNameForSystemRoot(const std::string& base, const std::strin
     char real[PATH_MAX];
     std::string path = ::realpath(root.c_str(), real) ? real : root;
     if (path == "/") return "/" + base;
-    unsigned char digest[SHA256_DIGEST_LENGTH];
-    SHA256(reinterpret_cast<const unsigned char*>(path.data()), path.size(), digest);
-    char hex[17];
-    for (int i = 0; i < 8; i++) std::snprintf(hex + 2 * i, 3, "%02x", digest[i]);
-    return "/" + base + "-" + hex;
+    return "/" + base + "-" + hexDigits(sha256(path).data(), 8);
 }
 
 bool semaphoreExists(const std::string& name) {

@@ -1,9 +1,7 @@
 #include "Platform/SandboxExtension.h"
 
 #include <fcntl.h>
-#include <openssl/crypto.h>
-#include <openssl/hmac.h>
-#include <openssl/rand.h>
+#include <sys/random.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
@@ -12,6 +10,7 @@
 #include <vector>
 
 #include "Platform/DurableIO.h"
+#include "Platform/Sha256.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {
@@ -20,17 +19,6 @@ namespace {
 
 constexpr size_t kKeyLength = 32;
 const char* const kVersion = "vsx1";
-
-std::string hex(const uint8_t* p, size_t n) {
-    static const char digits[] = "0123456789abcdef";
-    std::string out;
-    out.reserve(n * 2);
-    for (size_t i = 0; i < n; i++) {
-        out += digits[p[i] >> 4];
-        out += digits[p[i] & 15];
-    }
-    return out;
-}
 
 std::optional<std::vector<uint8_t>> readKey(const std::string& path) {
     int fd = ::open(path.c_str(), O_RDONLY | O_CLOEXEC);
@@ -52,9 +40,12 @@ std::optional<std::vector<uint8_t>> keyForIssuing() {
     std::string path = sandboxExtensionKeyPath();
     if (auto key = readKey(path)) return key;
     std::vector<uint8_t> key(kKeyLength);
-    if (RAND_bytes(key.data(), static_cast<int>(key.size())) != 1) {
-        errno = EIO;
-        return std::nullopt;
+    // Early in boot the pool may not be ready yet: this waits for it, as a key must not be guessable.
+    for (size_t got = 0; got < key.size();) {
+        const ssize_t n = ::getrandom(key.data() + got, key.size() - got, 0);
+        if (n < 0 && errno == EINTR) continue;
+        if (n < 0) return std::nullopt;
+        got += static_cast<size_t>(n);
     }
     ::mkdir(parentPath(parentPath(path)).c_str(), 0755);
     ::mkdir(parentPath(path).c_str(), 0755);
@@ -73,11 +64,9 @@ std::string mac(const std::vector<uint8_t>& key, const std::string& extensionCla
     std::string message = std::string(kVersion) + '\0' + extensionClass + '\0' + path + '\0';
     for (uint32_t w : token)
         for (int i = 0; i < 4; i++) message += static_cast<char>((w >> (8 * i)) & 0xff);
-    uint8_t out[EVP_MAX_MD_SIZE];
-    unsigned int length = 0;
-    HMAC(EVP_sha256(), key.data(), static_cast<int>(key.size()), reinterpret_cast<const uint8_t*>(message.data()),
-         message.size(), out, &length);
-    return hex(out, length);
+    const Sha256Digest digest =
+        hmacSha256(std::string_view(reinterpret_cast<const char*>(key.data()), key.size()), message);
+    return hexDigits(digest.data(), digest.size());
 }
 
 }  // namespace
@@ -97,7 +86,7 @@ bool verifySandboxFileExtension(const std::string& token, const std::string& ext
     auto key = readKey(keyPath);
     if (!key) return false;
     std::string expected = std::string(kVersion) + ";" + mac(*key, extensionClass, path, auditToken);
-    return token.size() == expected.size() && CRYPTO_memcmp(token.data(), expected.data(), token.size()) == 0;
+    return constantTimeEqual(token, expected);
 }
 
 }  // namespace vsl
