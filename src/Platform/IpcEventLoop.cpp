@@ -165,10 +165,14 @@ void IpcEventLoop::threadMain() {
             willBeIdle();
             armOneShot(epollFd_, timerFd_, kTimerKey, EPOLL_CTL_MOD);
         } else if (peer && handOff) {
-            peer->queue()->async([peer] { peer->service(); });
+            peer->queue()->async([peer] {
+                if (peer->service()) peer->arm();
+            });
         } else if (peer) {
             // Inline on this thread when the peer's queue is free.
-            peer->queue()->sync([&] { peer->service(); });
+            bool open = false;
+            peer->queue()->sync([&] { open = peer->service(); });
+            if (open) peer->arm();
         }
         peer.reset();
         lock.lock();

@@ -53,26 +53,26 @@ void IpcPeer::rearmLocked() {
     armed_ = true;
 }
 
-void IpcPeer::service() {
+bool IpcPeer::service() {
     const char* why = nullptr;
     {
         std::lock_guard lock(mutex_);
         armed_ = false;
-        if (closed_) return;
+        if (closed_) return false;
         lastUse_ = std::chrono::steady_clock::now();
         if (!outbox_.empty() && !flushLocked()) why = "write failed";
     }
     bool open = why == nullptr;
     if (open && outboxEmpty()) open = readAndHandle(&why);
-    if (open) loop_->willBeIdle();
-    std::unique_lock lock(mutex_);
-    if (!open) {
-        const bool closing = markClosedLocked(why);
-        lock.unlock();
-        if (closing) finishClose();
-        return;
+    if (open) {
+        loop_->willBeIdle();
+        return true;
     }
-    rearmLocked();
+    std::unique_lock lock(mutex_);
+    const bool closing = markClosedLocked(why);
+    lock.unlock();
+    if (closing) finishClose();
+    return false;
 }
 
 bool IpcPeer::outboxEmpty() const {

@@ -69,8 +69,10 @@ private:
     friend class IpcEventLoop;
 
     // Runs on the peer's queue: flushes pending output, reads and handles messages.
-    void service();
-    // First registration, once the connection handler has run.
+    // True when the connection stays open: the caller then re-arms it with arm(), after
+    // it has let go of the queue, so that the next message finds the queue free.
+    bool service();
+    // Registration, once the connection handler has run, and each re-arm after service().
     void arm();
     void rearmLocked();
     // Closes the connection when it waits for input with nothing owed either way and

@@ -7,6 +7,7 @@
 #include <cstdlib>
 #include <sys/eventfd.h>
 #include <thread>
+#include <utility>
 
 namespace vsl {
 
@@ -299,7 +300,7 @@ void WorkQueue::fail(const char* what) const {
     std::abort();
 }
 
-void WorkQueue::async(Work work) { push({std::move(work), nullptr}); }
+void WorkQueue::async(Work work) { push({std::move(work), nullptr, nullptr}); }
 
 void WorkQueue::push(Item item) {
     unsigned tokens;
@@ -340,19 +341,28 @@ void WorkQueue::drain() {
     if (!serial) --tokens_;
     // The main queue runs one item per turn so that a stop takes effect after it.
     const unsigned batch = serial && !mainThread_ ? kSerialBatch : 1;
+    std::function<void()> wake;  // the sync caller of the last item run
     for (unsigned done = 0; done < batch; ++done) {
         if (suspendCount_ > 0 || items_.empty()) break;
         Item item = std::move(items_.front());
         items_.pop_front();
         lock.unlock();
+        if (wake) std::exchange(wake, nullptr)();
         invoke(item.work, item.parent);
+        wake = std::move(item.done);
         item = {};  // release captures (and the transactions they hold) right after the run
         lock.lock();
     }
     if (serial) --tokens_;
+    releasedLocked();
     const unsigned tokens = claimTokensLocked();
     lock.unlock();
     issue(tokens);
+    if (wake) wake();
+}
+
+void WorkQueue::releasedLocked() {
+    if (syncWaiters_ > 0 && tokens_ == 0 && inlineRunning_ == 0) released_.notify_all();
 }
 
 void WorkQueue::invoke(const Work& work, const Frame* parent) {
@@ -369,6 +379,15 @@ void WorkQueue::sync(const Work& work) {
     }
     {
         std::unique_lock lock(mutex_);
+        // Held by another thread with nothing queued behind it (an I/O thread whose
+        // peer's next message came in before it let go, or a pool worker finishing
+        // its drain): wait for it, then run here.
+        while (attributes_.kind == Kind::Serial && !mainThread_ && suspendCount_ == 0 && items_.empty() &&
+               (tokens_ != 0 || inlineRunning_ != 0)) {
+            ++syncWaiters_;
+            released_.wait(lock);
+            --syncWaiters_;
+        }
         // Run on the caller's thread when the queue is free: no thread hand-off.
         const bool free = attributes_.kind == Kind::Serial
                               ? items_.empty() && tokens_ == 0 && inlineRunning_ == 0
@@ -379,6 +398,7 @@ void WorkQueue::sync(const Work& work) {
             invoke(work, currentFrame_);
             lock.lock();
             --inlineRunning_;
+            releasedLocked();
             const unsigned tokens = claimTokensLocked();
             lock.unlock();
             issue(tokens);
@@ -388,13 +408,11 @@ void WorkQueue::sync(const Work& work) {
     std::mutex doneMutex;
     std::condition_variable doneCv;
     bool done = false;
-    push({[&] {
-              work();
+    push({[&] { work(); }, currentFrame_, [&] {
               std::lock_guard lock(doneMutex);
               done = true;
               doneCv.notify_one();
-          },
-          currentFrame_});
+          }});
     std::unique_lock lock(doneMutex);
     doneCv.wait(lock, [&] { return done; });
 }

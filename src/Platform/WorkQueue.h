@@ -89,6 +89,9 @@ private:
     struct Item {
         Work work;
         const Frame* parent = nullptr;  // chain of the sync caller waiting on this item
+        // Wakes that sync caller; run once the queue has let go of the item, so that
+        // the caller's next sync finds the queue free and runs on its own thread.
+        std::function<void()> done;
     };
     static thread_local const Frame* currentFrame_;
     friend void runMainLoop();
@@ -110,6 +113,11 @@ private:
     // Pending pool entries. For a serial queue: 1 while scheduled or draining.
     size_t tokens_ = 0;
     size_t inlineRunning_ = 0;  // sync calls running on their caller's thread
+    // Sync callers waiting for another thread to let go of an otherwise empty serial
+    // queue, so that they run on their own thread instead of handing off to the pool.
+    size_t syncWaiters_ = 0;
+    std::condition_variable released_;
+    void releasedLocked();
 };
 
 // Drains the main queue on the calling thread until stopMainLoop(). Only one thread
