@@ -134,7 +134,8 @@ TEST_F(Boot, FirstBootWorkRunsOncePerBootAndItsNotificationFollowsTheOrphanClean
     // After a reboot: orphans and transient containers are gone by the time the
     // first-boot clean-up reports completion; the container with metadata stays.
     const std::string trace = daemon.at("durable.trace");
-    rebootAndSettle({"VESSELD_DURABLE_TRACE=" + trace});
+    // Numbered from start-up: the clean-up may run before or after the first client message.
+    rebootAndSettle({"VESSELD_DURABLE_TRACE=" + trace, "VESSELD_KILL_SCOPE=startup"});
     // The steps say the order: both orphans renamed into death row before the post.
     const std::string steps = readFile(trace);
     const size_t posted = steps.find("notify/" + std::string(kRebootCleanupCompleteNotification));
