@@ -8,6 +8,7 @@
 #include <climits>
 
 #include "Platform/Sha256.h"
+#include "Platform/Value.h"
 
 namespace vsl {
 

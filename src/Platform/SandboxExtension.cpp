@@ -11,6 +11,7 @@
 
 #include "Platform/DurableIO.h"
 #include "Platform/Sha256.h"
+#include "Platform/Value.h"
 #include "Platform/SystemRoot.h"
 
 namespace vsl {

@@ -146,17 +146,6 @@ Sha256Digest hmacSha256(std::string_view key, std::string_view message) {
     return outer.finish();
 }
 
-std::string hexDigits(const uint8_t* p, size_t n) {
-    static const char digits[] = "0123456789abcdef";
-    std::string out;
-    out.reserve(n * 2);
-    for (size_t i = 0; i < n; i++) {
-        out += digits[p[i] >> 4];
-        out += digits[p[i] & 15];
-    }
-    return out;
-}
-
 bool constantTimeEqual(std::string_view a, std::string_view b) {
     if (a.size() != b.size()) return false;
     volatile uint8_t diff = 0;

@@ -15,9 +15,6 @@ using Sha256Digest = std::array<uint8_t, 32>;
 Sha256Digest sha256(std::string_view data);
 Sha256Digest hmacSha256(std::string_view key, std::string_view message);
 
-// Lower-case hexadecimal of the first n bytes.
-std::string hexDigits(const uint8_t* p, size_t n);
-
 // Equal contents, in a time that depends only on the length.
 bool constantTimeEqual(std::string_view a, std::string_view b);
 

@@ -2,6 +2,7 @@
 
 #include <uuid/uuid.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cmath>
 #include <cstdio>
@@ -189,17 +190,10 @@ void describe(const Value& v, int indent, std::string& out, bool top) {
         }
         case Value::Type::String: out += top ? *v.stringValue() : quoted(*v.stringValue()); break;
         case Value::Type::Data: {
-            static const char hex[] = "0123456789abcdef";
-            out += "{length = " + std::to_string(v.dataValue()->size()) + ", bytes = 0x";
-            size_t n = 0;
-            for (uint8_t b : *v.dataValue()) {
-                if (n++ == 24) {
-                    out += "...";
-                    break;
-                }
-                out += hex[b >> 4];
-                out += hex[b & 15];
-            }
+            const Data& bytes = *v.dataValue();
+            out += "{length = " + std::to_string(bytes.size()) + ", bytes = 0x";
+            out += hexDigits(bytes.data(), std::min<size_t>(bytes.size(), 24));
+            if (bytes.size() > 24) out += "...";
             out += "}";
             break;
         }
@@ -243,6 +237,17 @@ void describe(const Value& v, int indent, std::string& out, bool top) {
 std::string Value::description() const {
     std::string out;
     describe(*this, 0, out, true);
+    return out;
+}
+
+std::string hexDigits(const uint8_t* p, size_t n) {
+    static const char digits[] = "0123456789abcdef";
+    std::string out;
+    out.reserve(n * 2);
+    for (size_t i = 0; i < n; i++) {
+        out += digits[p[i] >> 4];
+        out += digits[p[i] & 15];
+    }
     return out;
 }
 

@@ -94,6 +94,9 @@ private:
     std::shared_ptr<const Node> node_;
 };
 
+// Lower-case hexadecimal of the first n bytes.
+std::string hexDigits(const uint8_t* p, size_t n);
+
 // Small builder to make dictionary literals readable.
 inline Value dict(std::initializer_list<std::pair<const std::string, Value>> items) {
     return Value::dictionary(Dictionary(items));

@@ -317,7 +317,7 @@ unsigned WorkQueue::claimTokensLocked() {
     if (suspendCount_ > 0 || items_.empty()) return 0;
     size_t want = 0;
     if (attributes_.kind == Kind::Serial) {
-        want = (tokens_ == 0 && inlineRunning_ == 0) ? 1 : 0;
+        want = heldLocked() ? 0 : 1;
     } else if (items_.size() > tokens_) {
         want = items_.size() - tokens_;
     }
@@ -362,7 +362,7 @@ void WorkQueue::drain() {
 }
 
 void WorkQueue::releasedLocked() {
-    if (syncWaiters_ > 0 && tokens_ == 0 && inlineRunning_ == 0) released_.notify_all();
+    if (syncWaiters_ > 0 && !heldLocked()) released_.notify_all();
 }
 
 void WorkQueue::invoke(const Work& work, const Frame* parent) {
@@ -383,14 +383,14 @@ void WorkQueue::sync(const Work& work) {
         // peer's next message came in before it let go, or a pool worker finishing
         // its drain): wait for it, then run here.
         while (attributes_.kind == Kind::Serial && !mainThread_ && suspendCount_ == 0 && items_.empty() &&
-               (tokens_ != 0 || inlineRunning_ != 0)) {
+               heldLocked()) {
             ++syncWaiters_;
             released_.wait(lock);
             --syncWaiters_;
         }
         // Run on the caller's thread when the queue is free: no thread hand-off.
         const bool free = attributes_.kind == Kind::Serial
-                              ? items_.empty() && tokens_ == 0 && inlineRunning_ == 0
+                              ? items_.empty() && !heldLocked()
                               : true;
         if (!mainThread_ && suspendCount_ == 0 && free) {
             ++inlineRunning_;

@@ -113,6 +113,8 @@ private:
     // Pending pool entries. For a serial queue: 1 while scheduled or draining.
     size_t tokens_ = 0;
     size_t inlineRunning_ = 0;  // sync calls running on their caller's thread
+    // A serial queue is held while a pool entry drains it or a sync call runs inline.
+    bool heldLocked() const { return tokens_ != 0 || inlineRunning_ != 0; }
     // Sync callers waiting for another thread to let go of an otherwise empty serial
     // queue, so that they run on their own thread instead of handing off to the pool.
     size_t syncWaiters_ = 0;

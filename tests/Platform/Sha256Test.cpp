@@ -3,6 +3,7 @@
 #include <string>
 
 #include "Platform/Sha256.h"
+#include "Platform/Value.h"
 
 using namespace vsl;
 
